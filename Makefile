@@ -1,0 +1,66 @@
+# tarvod: build, test and run. See README.md.
+SHELL := /bin/bash
+BUILD_TYPE ?= RelWithDebInfo
+JOBS ?= $(shell nproc)
+WERROR ?= $(if $(CI),ON,OFF)
+CMAKE_FLAGS := -G Ninja -DCMAKE_BUILD_TYPE=$(BUILD_TYPE) -DTARVOD_WERROR=$(WERROR)
+
+# Debian packages the build, the tests and `make run` need.
+PACKAGES := build-essential cmake ninja-build pkg-config clang-format \
+  libplist-dev libsystemd-dev libcurl4-openssl-dev \
+  libgtest-dev libgmock-dev libbenchmark-dev \
+  dbus-daemon systemd util-linux procps bsd-mailx python3 python3-aiosmtpd
+
+.PHONY: all deps build build-asan build-tsan test test-unit test-asan test-tsan run bench format clean
+
+all: build
+
+deps:
+	@missing=$$(for p in $(PACKAGES); do \
+	  dpkg-query -W -f='$${Status}\n' $$p 2>/dev/null | grep -q 'install ok installed' || echo $$p; done); \
+	if [ -n "$$missing" ]; then \
+	  echo "Installing:" $$missing; \
+	  if [ "$$(id -u)" = 0 ]; then SUDO=; else SUDO=sudo; fi; \
+	  $$SUDO apt-get update -qq && \
+	  DEBIAN_FRONTEND=noninteractive $$SUDO apt-get install -y -qq --no-install-recommends $$missing >/dev/null; \
+	fi
+
+build: deps
+	cmake -S . -B build $(CMAKE_FLAGS) >/dev/null
+	ninja -C build -j $(JOBS)
+
+build-asan: deps
+	cmake -S . -B build-asan $(CMAKE_FLAGS) -DTARVOD_SANITIZE=address -DTARVOD_BENCH=OFF >/dev/null
+	ninja -C build-asan -j $(JOBS)
+
+build-tsan: deps
+	cmake -S . -B build-tsan $(CMAKE_FLAGS) -DTARVOD_SANITIZE=thread -DTARVOD_BENCH=OFF >/dev/null
+	ninja -C build-tsan -j $(JOBS)
+
+test-unit: build
+	ctest --test-dir build --output-on-failure -j $(JOBS)
+
+test-asan: build-asan
+	ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1 \
+	  ctest --test-dir build-asan --output-on-failure -j $(JOBS)
+
+# The threaded parts (queues, dispatch, listeners) under ThreadSanitizer.
+test-tsan: build-tsan
+	TSAN_OPTIONS=halt_on_error=1:second_deadlock_stack=1 \
+	  ctest --test-dir build-tsan --output-on-failure -j $(JOBS) -L threaded
+
+test: test-unit test-asan test-tsan
+
+bench: build
+	@for b in build/bench/*_bench; do [ -x "$$b" ] && "$$b"; done
+
+# Starts tarvod in the foreground on the bundled example; everything it writes goes to run/.
+run: build
+	@mkdir -p run
+	./build/src/daemon/tarvod -c examples/tarvod.plist -r examples/rules
+
+format:
+	git ls-files '*.cc' '*.h' | xargs clang-format -i
+
+clean:
+	rm -rf build build-asan build-tsan run

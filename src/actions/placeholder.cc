@@ -1,0 +1,1 @@
+// Handlers of the rules' actions.

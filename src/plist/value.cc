@@ -1,0 +1,448 @@
+#include "plist/value.h"
+
+#include <algorithm>
+#include <charconv>
+#include <cmath>
+#include <cstdio>
+#include <ctime>
+#include <limits>
+
+namespace plist {
+
+namespace internal {
+DictionaryBox::DictionaryBox() : p_(std::make_unique<Dictionary>()) {}
+DictionaryBox::DictionaryBox(Dictionary d) : p_(std::make_unique<Dictionary>(std::move(d))) {}
+DictionaryBox::DictionaryBox(const DictionaryBox& other)
+    : p_(std::make_unique<Dictionary>(*other.p_)) {}
+DictionaryBox::DictionaryBox(DictionaryBox&& other) noexcept
+    : p_(std::exchange(other.p_, nullptr)) {
+  if (!p_) p_ = std::make_unique<Dictionary>();
+}
+DictionaryBox& DictionaryBox::operator=(const DictionaryBox& other) {
+  if (this != &other) p_ = std::make_unique<Dictionary>(*other.p_);
+  return *this;
+}
+DictionaryBox& DictionaryBox::operator=(DictionaryBox&& other) noexcept {
+  std::swap(p_, other.p_);
+  return *this;
+}
+DictionaryBox::~DictionaryBox() = default;
+}  // namespace internal
+
+Value::Value(Dictionary d) : v_(internal::DictionaryBox(std::move(d))) {}
+
+const Dictionary* Value::asDictionary() const {
+  auto* box = std::get_if<internal::DictionaryBox>(&v_);
+  return box ? &box->get() : nullptr;
+}
+Dictionary* Value::asDictionary() {
+  auto* box = std::get_if<internal::DictionaryBox>(&v_);
+  return box ? &box->get() : nullptr;
+}
+const Dictionary& Value::dictionary() const { return std::get<internal::DictionaryBox>(v_).get(); }
+Dictionary& Value::dictionary() { return std::get<internal::DictionaryBox>(v_).get(); }
+
+namespace {
+
+bool IsSpace(char c) {
+  return c == ' ' || c == '\t' || c == '\n' || c == '\r' || c == '\f' || c == '\v';
+}
+bool IsDigit(char c) { return c >= '0' && c <= '9'; }
+
+int64_t ClampToInt64(double d) {
+  if (std::isnan(d)) return 0;
+  if (d >= 9223372036854775807.0) return std::numeric_limits<int64_t>::max();
+  if (d <= -9223372036854775808.0) return std::numeric_limits<int64_t>::min();
+  return static_cast<int64_t>(d);
+}
+
+}  // namespace
+
+double LeadingNumber(std::string_view text) {
+  size_t i = 0;
+  while (i < text.size() && IsSpace(text[i])) ++i;
+  const size_t start = i;
+  if (i < text.size() && (text[i] == '+' || text[i] == '-')) ++i;
+  size_t digits = 0;
+  while (i < text.size() && IsDigit(text[i])) ++i, ++digits;
+  if (i < text.size() && text[i] == '.') {
+    ++i;
+    while (i < text.size() && IsDigit(text[i])) ++i, ++digits;
+  }
+  if (digits == 0) return 0.0;
+  if (i < text.size() && (text[i] == 'e' || text[i] == 'E')) {
+    size_t j = i + 1;
+    if (j < text.size() && (text[j] == '+' || text[j] == '-')) ++j;
+    if (j < text.size() && IsDigit(text[j])) {
+      while (j < text.size() && IsDigit(text[j])) ++j;
+      i = j;
+    }
+  }
+  // from_chars does not take a leading '+'.
+  size_t from = start;
+  if (text[from] == '+') ++from;
+  double result = 0;
+  auto [ptr, ec] = std::from_chars(text.data() + from, text.data() + i, result);
+  if (ec == std::errc::result_out_of_range) {
+    // Overflow reads as infinity of the right sign, underflow as zero.
+    const bool negative = text[from] == '-';
+    std::string_view digitsText = text.substr(from, i - from);
+    const bool tiny = digitsText.find_first_of("eE") != std::string_view::npos &&
+                      digitsText.find("e-") != std::string_view::npos;
+    if (tiny) return negative ? -0.0 : 0.0;
+    return negative ? -std::numeric_limits<double>::infinity()
+                    : std::numeric_limits<double>::infinity();
+  }
+  (void)ptr;
+  return result;
+}
+
+int64_t LeadingInteger(std::string_view text) {
+  size_t i = 0;
+  while (i < text.size() && IsSpace(text[i])) ++i;
+  bool negative = false;
+  if (i < text.size() && (text[i] == '+' || text[i] == '-')) negative = text[i++] == '-';
+  uint64_t magnitude = 0;
+  bool overflow = false;
+  for (; i < text.size() && IsDigit(text[i]); ++i) {
+    const uint64_t digit = static_cast<uint64_t>(text[i] - '0');
+    if (magnitude > (std::numeric_limits<uint64_t>::max() - digit) / 10) {
+      overflow = true;
+    } else {
+      magnitude = magnitude * 10 + digit;
+    }
+  }
+  const uint64_t limit = negative ? uint64_t{1} << 63 : (uint64_t{1} << 63) - 1;
+  if (overflow || magnitude > limit) {
+    return negative ? std::numeric_limits<int64_t>::min() : std::numeric_limits<int64_t>::max();
+  }
+  return negative ? static_cast<int64_t>(0 - magnitude) : static_cast<int64_t>(magnitude);
+}
+
+double Value::numberValue() const {
+  switch (kind()) {
+    case Kind::kInteger:
+      return static_cast<double>(integer());
+    case Kind::kReal:
+      return real();
+    case Kind::kBoolean:
+      return boolean() ? 1.0 : 0.0;
+    case Kind::kDate:
+      return date().secondsSince2001;
+    case Kind::kString:
+      return LeadingNumber(string());
+    default:
+      return 0.0;
+  }
+}
+
+int64_t Value::integerValue() const {
+  switch (kind()) {
+    case Kind::kInteger:
+      return integer();
+    case Kind::kReal:
+      return ClampToInt64(real());
+    case Kind::kBoolean:
+      return boolean() ? 1 : 0;
+    case Kind::kDate:
+      return ClampToInt64(date().secondsSince2001);
+    case Kind::kString:
+      return LeadingInteger(string());
+    default:
+      return 0;
+  }
+}
+
+bool Value::boolValue() const {
+  switch (kind()) {
+    case Kind::kBoolean:
+      return boolean();
+    case Kind::kInteger:
+      return integer() != 0;
+    case Kind::kReal:
+      return real() != 0.0;
+    case Kind::kString: {
+      const std::string& s = string();
+      size_t i = 0;
+      while (i < s.size() && IsSpace(s[i])) ++i;
+      if (i < s.size() && (s[i] == 'Y' || s[i] == 'y' || s[i] == 'T' || s[i] == 't')) return true;
+      return LeadingInteger(s) != 0;
+    }
+    default:
+      return false;
+  }
+}
+
+bool Value::operator==(const Value& other) const {
+  if (kind() != other.kind()) return false;
+  switch (kind()) {
+    case Kind::kDictionary:
+      return dictionary() == other.dictionary();
+    case Kind::kReal:
+      return real() == other.real() || (std::isnan(real()) && std::isnan(other.real()));
+    default:
+      return v_ == other.v_;
+  }
+}
+
+Dictionary::Dictionary(std::initializer_list<Entry> entries) {
+  for (const auto& [key, value] : entries) set(key, value);
+}
+
+const Value* Dictionary::find(std::string_view key) const {
+  for (const auto& entry : entries_) {
+    if (entry.first == key) return &entry.second;
+  }
+  return nullptr;
+}
+
+Value* Dictionary::find(std::string_view key) {
+  for (auto& entry : entries_) {
+    if (entry.first == key) return &entry.second;
+  }
+  return nullptr;
+}
+
+const std::string* Dictionary::findString(std::string_view key) const {
+  const Value* v = find(key);
+  return v ? v->asString() : nullptr;
+}
+const Array* Dictionary::findArray(std::string_view key) const {
+  const Value* v = find(key);
+  return v ? v->asArray() : nullptr;
+}
+const Dictionary* Dictionary::findDictionary(std::string_view key) const {
+  const Value* v = find(key);
+  return v ? v->asDictionary() : nullptr;
+}
+Dictionary* Dictionary::findDictionary(std::string_view key) {
+  Value* v = find(key);
+  return v ? v->asDictionary() : nullptr;
+}
+
+void Dictionary::set(std::string_view key, Value value) {
+  if (Value* existing = find(key)) {
+    *existing = std::move(value);
+    return;
+  }
+  entries_.emplace_back(std::string(key), std::move(value));
+}
+
+bool Dictionary::erase(std::string_view key) {
+  auto it = std::find_if(entries_.begin(), entries_.end(),
+                         [&](const Entry& e) { return e.first == key; });
+  if (it == entries_.end()) return false;
+  entries_.erase(it);
+  return true;
+}
+
+std::vector<std::string> Dictionary::sortedKeys() const {
+  std::vector<std::string> keys;
+  keys.reserve(entries_.size());
+  for (const auto& entry : entries_) keys.push_back(entry.first);
+  std::sort(keys.begin(), keys.end());
+  return keys;
+}
+
+std::string FormatDate(Date date, bool localTime) {
+  double seconds = std::floor(date.secondsSince2001 + kUnixTimeOfReferenceDate);
+  if (!std::isfinite(seconds) || seconds > 253402300799.0 || seconds < -62135596800.0) {
+    seconds = kUnixTimeOfReferenceDate;  // outside years 1 to 9999: show the reference date
+  }
+  const time_t t = static_cast<time_t>(seconds);
+  struct tm tm {};
+  if (localTime) {
+    localtime_r(&t, &tm);
+  } else {
+    gmtime_r(&t, &tm);
+  }
+  const long offset = localTime ? tm.tm_gmtoff : 0;
+  const long absOffset = offset < 0 ? -offset : offset;
+  char buffer[64];
+  std::snprintf(buffer, sizeof buffer, "%04d-%02d-%02d %02d:%02d:%02d %c%02ld%02ld",
+                tm.tm_year + 1900, tm.tm_mon + 1, tm.tm_mday, tm.tm_hour, tm.tm_min, tm.tm_sec,
+                offset < 0 ? '-' : '+', absOffset / 3600, (absOffset % 3600) / 60);
+  return buffer;
+}
+
+namespace {
+
+std::string FormatReal(double d) {
+  if (std::isnan(d)) return "nan";
+  if (std::isinf(d)) return d < 0 ? "-inf" : "inf";
+  char buffer[64];
+  auto [ptr, ec] = std::to_chars(buffer, buffer + sizeof buffer, d);
+  return std::string(buffer, ec == std::errc() ? ptr : buffer);
+}
+
+std::string FormatData(const Data& data) {
+  static const char kHex[] = "0123456789abcdef";
+  std::string out = "<";
+  for (size_t i = 0; i < data.size(); ++i) {
+    if (i > 0 && i % 4 == 0) out += ' ';
+    out += kHex[data[i] >> 4];
+    out += kHex[data[i] & 0xF];
+  }
+  out += '>';
+  return out;
+}
+
+bool IsWordStart(char c) {
+  return (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || c == '_' || c == '$' || c == '/';
+}
+bool IsWordChar(char c) { return IsWordStart(c) || IsDigit(c) || c == '.' || c == '-' || c == ':'; }
+
+// A string is written bare only when the reader cannot take it for anything else.
+bool IsPlainWord(const std::string& s) {
+  if (s.empty() || !IsWordStart(s[0])) return false;
+  if (s == "true" || s == "false" || s == "nan" || s == "inf") return false;
+  return std::all_of(s.begin(), s.end(), IsWordChar);
+}
+
+void AppendQuoted(std::string& out, const std::string& s) {
+  if (IsPlainWord(s)) {
+    out += s;
+    return;
+  }
+  out += '"';
+  for (unsigned char c : s) {
+    switch (c) {
+      case '"':
+        out += "\\\"";
+        break;
+      case '\\':
+        out += "\\\\";
+        break;
+      case '\n':
+        out += "\\n";
+        break;
+      case '\t':
+        out += "\\t";
+        break;
+      case '\r':
+        out += "\\r";
+        break;
+      default:
+        if (c < 0x20 || c == 0x7F) {
+          char buffer[8];
+          std::snprintf(buffer, sizeof buffer, "\\U%04x", c);
+          out += buffer;
+        } else {
+          out += static_cast<char>(c);
+        }
+    }
+  }
+  out += '"';
+}
+
+void AppendIndent(std::string& out, int depth) { out.append(static_cast<size_t>(depth) * 4, ' '); }
+
+// Iterative over containers would need an explicit stack; values built by our readers are
+// bounded in depth (see codec.h), so plain recursion is safe here.
+void AppendDescription(std::string& out, const Value& value, int depth) {
+  switch (value.kind()) {
+    case Value::Kind::kString:
+      AppendQuoted(out, value.string());
+      break;
+    case Value::Kind::kInteger:
+      out += std::to_string(value.integer());
+      break;
+    case Value::Kind::kReal: {
+      const double d = value.real();
+      if (!std::isfinite(d)) {
+        out += "<*R" + FormatReal(d) + ">";
+      } else {
+        std::string text = FormatReal(d);
+        if (text.find_first_of(".e") == std::string::npos) text += ".0";
+        out += text;
+      }
+      break;
+    }
+    case Value::Kind::kBoolean:
+      out += value.boolean() ? "true" : "false";
+      break;
+    case Value::Kind::kDate:
+      out += "<*D" + FormatDate(value.date(), false) + ">";
+      break;
+    case Value::Kind::kData:
+      out += FormatData(value.data());
+      break;
+    case Value::Kind::kArray: {
+      const Array& array = value.array();
+      if (array.empty()) {
+        out += "()";
+        break;
+      }
+      out += "(\n";
+      for (size_t i = 0; i < array.size(); ++i) {
+        AppendIndent(out, depth + 1);
+        AppendDescription(out, array[i], depth + 1);
+        out += i + 1 < array.size() ? ",\n" : "\n";
+      }
+      AppendIndent(out, depth);
+      out += ')';
+      break;
+    }
+    case Value::Kind::kDictionary: {
+      const Dictionary& dictionary = value.dictionary();
+      if (dictionary.empty()) {
+        out += "{}";
+        break;
+      }
+      out += "{\n";
+      for (const auto& [key, item] : dictionary) {
+        AppendIndent(out, depth + 1);
+        AppendQuoted(out, key);
+        out += " = ";
+        AppendDescription(out, item, depth + 1);
+        out += ";\n";
+      }
+      AppendIndent(out, depth);
+      out += '}';
+      break;
+    }
+  }
+}
+
+}  // namespace
+
+std::string Describe(const Value& value) {
+  std::string out;
+  AppendDescription(out, value, 0);
+  return out;
+}
+
+std::string Describe(const Dictionary& dictionary) {
+  // Copying would double the cost of every event print; wrap without copying instead.
+  std::string out;
+  if (dictionary.empty()) return "{}";
+  out += "{\n";
+  for (const auto& [key, item] : dictionary) {
+    AppendIndent(out, 1);
+    AppendQuoted(out, key);
+    out += " = ";
+    AppendDescription(out, item, 1);
+    out += ";\n";
+  }
+  out += '}';
+  return out;
+}
+
+std::string Value::textForm() const {
+  switch (kind()) {
+    case Kind::kString:
+      return string();
+    case Kind::kInteger:
+      return std::to_string(integer());
+    case Kind::kReal:
+      return FormatReal(real());
+    case Kind::kBoolean:
+      return boolean() ? "true" : "false";
+    case Kind::kDate:
+      return FormatDate(date(), false);
+    default:
+      return Describe(*this);
+  }
+}
+
+}  // namespace plist
