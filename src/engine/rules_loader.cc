@@ -1,0 +1,117 @@
+#include "engine/rules_loader.h"
+
+#include <algorithm>
+#include <filesystem>
+#include <system_error>
+
+#include "context/context.h"
+#include "platform/diagnostic_log.h"
+#include "plist/codec.h"
+
+namespace tarvod {
+namespace {
+
+namespace fs = std::filesystem;
+
+std::string RuleName(const plist::Dictionary& rule) {
+  const plist::Value* name = rule.find("name");
+  return name ? name->textForm() : "(null)";
+}
+
+// Assigns a rule's "eval on load" variables, keys in ascending order.
+void AssignLoadTimeVariables(const RulebasePtr& rulebase, const VariableStorePtr& variables,
+                             const std::string& variablesPath, const std::string& rulesFile) {
+  LogMessage(3, "  preparing the \"eval on load\" vairables (from path %s)", variablesPath.c_str());
+  if (std::optional<plist::Dictionary> loaded = LoadVariablesFile(variablesPath)) {
+    Context context(variables, rulebase);
+    for (const std::string& key : loaded->sortedKeys()) {
+      context.setVariableValue(*loaded->find(key), key, rulesFile);
+    }
+  }
+  LogMessage(3, "  finished with the \"eval on load\" vairables");
+}
+
+}  // namespace
+
+std::optional<plist::Dictionary> LoadVariablesFile(const std::string& path) {
+  std::optional<plist::Value> file = plist::ReadPropertyListFile(path);
+  if (!file || !file->isDictionary()) {
+    LogMessage(4, "ERROR: Unable to load vairables from %s", path.c_str());
+    return std::nullopt;
+  }
+  return std::move(file->dictionary());
+}
+
+size_t LoadRulesFile(const RulebasePtr& rulebase, const VariableStorePtr& variables,
+                     const std::string& path) {
+  std::optional<plist::Value> file = plist::ReadPropertyListFile(path);
+  if (!file || !file->isArray()) return 0;
+  LogMessage(2, "LOADING RULES (%s)", path.c_str());
+  size_t accepted = 0;
+  for (plist::Value& element : file->array()) {
+    plist::Dictionary* source = element.asDictionary();
+    if (!source) continue;
+    const plist::Array* eventTypes = source->findArray("eventTypes");
+    if (!eventTypes) continue;
+    const std::string name = RuleName(*source);
+    if (const plist::Value* enabled = source->find("enabled"); enabled && !enabled->boolValue()) {
+      LogMessage(3, "  Skipping disabled rule: %s", name.c_str());
+      continue;
+    }
+    source->set("filePath", plist::Value(path));
+    if (const plist::Value* loadWith = source->find("loadVariablesWithRule")) {
+      AssignLoadTimeVariables(rulebase, variables, loadWith->textForm(), path);
+    }
+    const plist::Array types = *eventTypes;
+    auto rule = std::make_shared<const Rule>(std::move(*source));
+    for (const plist::Value& type : types) {
+      // Types are matched as exact strings; anything else in the list cannot match an event.
+      const std::string key = type.textForm();
+      (*rulebase)[key].rules.push_back(rule);
+      LogMessage(3, "  Added rule: %s", name.c_str());
+    }
+    ++accepted;
+  }
+  LogMessage(2, "%s", "");
+  return accepted;
+}
+
+size_t LoadRulesDirectory(const RulebasePtr& rulebase, const VariableStorePtr& variables,
+                          const std::string& path) {
+  LogMessage(3, "Loading rules files from %s\n", path.c_str());
+  // Entries are visited depth first, each directory's entries sorted by name, so that the
+  // order rules run in does not depend on how the file system happens to list them.
+  std::vector<std::string> pending{path};
+  size_t total = 0;
+  while (!pending.empty()) {
+    const std::string directory = std::move(pending.back());
+    pending.pop_back();
+    std::error_code error;
+    std::vector<fs::directory_entry> entries;
+    for (fs::directory_iterator it(directory, error), end; !error && it != end;
+         it.increment(error)) {
+      entries.push_back(*it);
+    }
+    std::sort(entries.begin(), entries.end(),
+              [](const auto& a, const auto& b) { return a.path().filename() < b.path().filename(); });
+    std::vector<std::string> subdirectories;
+    for (const fs::directory_entry& entry : entries) {
+      std::string entryPath = directory;
+      if (entryPath.empty() || entryPath.back() != '/') entryPath += '/';
+      entryPath += entry.path().filename().string();
+      std::error_code typeError;
+      if (entry.is_directory(typeError) && !entry.is_symlink(typeError)) {
+        subdirectories.push_back(entryPath);
+        continue;
+      }
+      total += LoadRulesFile(rulebase, variables, entryPath);
+    }
+    // Pushed in reverse so the first subdirectory is walked first.
+    for (auto it = subdirectories.rbegin(); it != subdirectories.rend(); ++it) {
+      pending.push_back(*it);
+    }
+  }
+  return total;
+}
+
+}  // namespace tarvod

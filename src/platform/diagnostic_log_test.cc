@@ -1,0 +1,110 @@
+#include "platform/diagnostic_log.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+namespace tarvod {
+namespace {
+
+std::string Slurp(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::ostringstream s;
+  s << in.rdbuf();
+  return s.str();
+}
+
+class DiagnosticLogTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/tarvod-log-XXXXXX";
+    dir_ = mkdtemp(pattern);
+    path_ = dir_ + "/error.log";
+    const int fd = SafeOpen(path_.c_str(), 0600, O_WRONLY | O_APPEND);
+    ASSERT_GE(fd, 0);
+    AttachErrorLog(fd);
+  }
+  void TearDown() override {
+    CloseLogs();
+    SetDebugLevel(0);
+    std::system(("rm -rf " + dir_).c_str());
+  }
+  std::string dir_, path_;
+};
+
+TEST_F(DiagnosticLogTest, WritesOnlyLevelsUpToTheDebugLevel) {
+  SetDebugLevel(3);
+  for (int level = 0; level <= 6; ++level) LogMessage(level, "level %d", level);
+  SetDebugLevel(-1);
+  LogMessage(0, "never");
+  EXPECT_EQ(Slurp(path_), "level 0\nlevel 1\nlevel 2\nlevel 3\n");
+}
+
+TEST_F(DiagnosticLogTest, CutsLongMessagesAndAlwaysAddsOneNewline) {
+  LogMessage(0, "%s", std::string(3000, 'x').c_str());
+  LogMessage(0, "Loaded %d rules\n", 2);
+  EXPECT_EQ(Slurp(path_), std::string(2047, 'x') + "\nLoaded 2 rules\n\n");
+}
+
+TEST_F(DiagnosticLogTest, LinesFromConcurrentWritersNeverInterleave) {
+  std::vector<std::thread> writers;
+  for (int t = 0; t < 4; ++t) {
+    writers.emplace_back([t] {
+      for (int i = 0; i < 200; ++i) LogMessage(0, "%d:%s", t, std::string(100, 'a' + t).c_str());
+    });
+  }
+  for (auto& w : writers) w.join();
+  std::istringstream lines(Slurp(path_));
+  std::string line;
+  int count = 0;
+  while (std::getline(lines, line)) {
+    ++count;
+    ASSERT_EQ(line.size(), 102u);
+    EXPECT_EQ(line.substr(2), std::string(100, static_cast<char>('a' + (line[0] - '0'))));
+  }
+  EXPECT_EQ(count, 800);
+}
+
+TEST_F(DiagnosticLogTest, NothingIsWrittenAfterTheLogsAreClosed) {
+  LogMessage(0, "before");
+  CloseLogs();
+  LogMessage(0, "after");
+  EXPECT_EQ(Slurp(path_), "before\n");
+}
+
+TEST_F(DiagnosticLogTest, SafeOpenRefusesLinksAndAcceptsHardLinks) {
+  const std::string target = dir_ + "/target";
+  const std::string soft = dir_ + "/soft";
+  const std::string hard = dir_ + "/hard";
+  const std::string fresh = dir_ + "/fresh";
+  ASSERT_EQ(close(open(target.c_str(), O_CREAT | O_WRONLY, 0644)), 0);
+  ASSERT_EQ(symlink(target.c_str(), soft.c_str()), 0);
+  ASSERT_EQ(link(target.c_str(), hard.c_str()), 0);
+
+  errno = 0;
+  EXPECT_EQ(SafeOpen(soft.c_str(), 0600, O_WRONLY | O_APPEND), -1);
+  EXPECT_EQ(errno, EACCES);
+  const int fd = SafeOpen(hard.c_str(), 0600, O_WRONLY | O_APPEND);
+  EXPECT_GE(fd, 0);
+  close(fd);
+
+  const mode_t old = umask(0);
+  const int created = SafeOpen(fresh.c_str(), 0600, O_WRONLY | O_APPEND);
+  umask(old);
+  ASSERT_GE(created, 0);
+  close(created);
+  struct stat st {};
+  ASSERT_EQ(stat(fresh.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+}
+
+}  // namespace
+}  // namespace tarvod

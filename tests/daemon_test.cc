@@ -1,0 +1,241 @@
+// The daemon's start and stop: command line, configuration, logs and rule loading, observed
+// through the real binary's exit status and error log.
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "harness.h"
+
+namespace tarvod::testing {
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+std::string String(std::string_view s) { return "<string>" + std::string(s) + "</string>"; }
+
+std::string RuleXml(std::string_view name, std::string_view eventTypesXml,
+                    std::string_view extra = {}) {
+  return "<dict><key>name</key><string>" + std::string(name) +
+         "</string><key>eventTypes</key>" + std::string(eventTypesXml) + std::string(extra) +
+         "</dict>";
+}
+
+std::string RulesFile(const std::vector<std::string>& rules) {
+  std::string body = "<array>";
+  for (const auto& r : rules) body += r;
+  return PlistDocument(body + "</array>");
+}
+
+class DaemonTest : public ::testing::Test {
+ protected:
+  std::string errorLog() const { return dir.file("error.log"); }
+  std::string writeConfig(std::vector<std::pair<std::string, std::string>> extra = {}) const {
+    extra.insert(extra.begin(), {"errorLogPath", String(errorLog())});
+    return dir.write("tarvod.plist", ConfigPlist(extra));
+  }
+  std::string writeOneRule() const {
+    return dir.write("rules/a.plist",
+                     RulesFile({RuleXml("first", "<array><string>x.y</string></array>")}));
+  }
+  RunResult run(const std::vector<std::string>& args) const {
+    std::vector<std::string> argv{TarvodBinary()};
+    argv.insert(argv.end(), args.begin(), args.end());
+    return RunProgram(argv);
+  }
+
+  TempDir dir;
+};
+
+TEST_F(DaemonTest, UsageErrorPrintsOnlyTheUsageLineAndExits255) {
+  for (const std::vector<std::string>& args :
+       {std::vector<std::string>{"-x"}, {"-c"}, {"-r", "rules", "-v"}}) {
+    TempDir empty;
+    std::vector<std::string> argv{TarvodBinary()};
+    argv.insert(argv.end(), args.begin(), args.end());
+    const RunResult result = RunProgram(argv);
+    EXPECT_EQ(result.status, 255);
+    EXPECT_EQ(result.err, "Usage: " + TarvodBinary() +
+                              " [ -r <rules.plist>] [-c <config file> ] [-v <debug level>] [-n]\n");
+    EXPECT_EQ(result.out, "");
+  }
+}
+
+TEST_F(DaemonTest, QuitsWithStatusZeroWhenNoRulesAreFound) {
+  const std::string config = writeConfig();
+  mkdir(dir.file("empty").c_str(), 0755);
+  for (const std::string& rules : {dir.file("empty"), dir.file("missing")}) {
+    const RunResult result = run({"-c", config, "-r", rules});
+    EXPECT_EQ(result.status, 0) << result.err;
+    const std::string log = ReadFile(errorLog());
+    EXPECT_THAT(log, HasSubstr("No rules found in " + rules + ", quitting....\n"));
+    EXPECT_THAT(log, HasSubstr("Velkin Shutdown at "));
+  }
+}
+
+TEST_F(DaemonTest, DebugLevelComesFromTheCommandLineUnlessItIsZero) {
+  const std::string rules = dir.file("empty");
+  mkdir(rules.c_str(), 0755);
+  struct Case {
+    std::string option;
+    std::string configured;
+    bool expectLevel1;
+    bool expectLevel4;
+  };
+  for (const Case& c : {Case{"0", "", false, false}, Case{"0", "1", true, false},
+                        Case{"3", "1", true, false}, Case{"4", "", true, true},
+                        Case{" +4x", "", true, true}, Case{"-1", "6", false, false}}) {
+    std::remove(errorLog().c_str());
+    std::vector<std::pair<std::string, std::string>> extra;
+    if (!c.configured.empty()) extra.emplace_back("debugLevel", "<integer>" + c.configured + "</integer>");
+    const std::string config = writeConfig(extra);
+    ASSERT_EQ(run({"-c", config, "-r", rules, "-v", c.option}).status, 0);
+    const std::string log = ReadFile(errorLog());
+    SCOPED_TRACE("-v '" + c.option + "' debugLevel '" + c.configured + "'");
+    EXPECT_EQ(log.find("Loaded 0 rules") != std::string::npos, c.expectLevel1);
+    EXPECT_EQ(log.find("Velkin rules path is") != std::string::npos, c.expectLevel4);
+    // Level-0 messages are written unless the level is negative.
+    EXPECT_EQ(log.find("Velkin Started") != std::string::npos, c.option != "-1");
+  }
+}
+
+TEST_F(DaemonTest, ErrorLogIsCreatedPrivateAndAppendedTo) {
+  const std::string config = writeConfig();
+  const std::string rules = dir.file("missing");
+  ASSERT_EQ(run({"-c", config, "-r", rules}).status, 0);
+  struct stat st {};
+  ASSERT_EQ(stat(errorLog().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  const std::string first = ReadFile(errorLog());
+  ASSERT_EQ(run({"-c", config, "-r", rules}).status, 0);
+  const std::string both = ReadFile(errorLog());
+  EXPECT_EQ(both.substr(0, first.size()), first);
+  EXPECT_GT(both.size(), first.size());
+  // Each message is its text and exactly one newline; "Loaded %d rules\n" leaves an empty line.
+  EXPECT_THAT(both, Not(HasSubstr("\n\n\n")));
+}
+
+TEST_F(DaemonTest, SymbolicLinkAtTheErrorLogPathIsRefusedAndHardLinkAccepted) {
+  const std::string target = dir.write("target.log", "existing\n");
+  const std::string config = writeConfig();
+  ASSERT_EQ(symlink(target.c_str(), errorLog().c_str()), 0);
+  RunResult result = run({"-c", config, "-r", dir.file("missing")});
+  EXPECT_EQ(result.status, 255);
+  EXPECT_THAT(result.err, HasSubstr("failed to open " + errorLog() + " errno = 13"));
+  EXPECT_EQ(ReadFile(target), "existing\n");
+
+  unlink(errorLog().c_str());
+  ASSERT_EQ(link(target.c_str(), errorLog().c_str()), 0);
+  result = run({"-c", config, "-r", dir.file("missing")});
+  EXPECT_EQ(result.status, 0);
+  EXPECT_THAT(ReadFile(target), HasSubstr("No rules found"));
+  EXPECT_EQ(ReadFile(target).rfind("existing\n", 0), 0u);
+}
+
+TEST_F(DaemonTest, LongMessagesAreCutTo2047BytesAndOneNewline) {
+  const std::string longName(3000, 'n');
+  const std::string rules = dir.write(
+      "rules.plist", RulesFile({RuleXml(longName, "<array><string>x</string></array>")}));
+  const std::string config = writeConfig({{"debugLevel", "<integer>3</integer>"}});
+  Daemon daemon({"-c", config, "-r", rules}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+  EXPECT_EQ(daemon.stop(), 0);
+  const std::string log = ReadFile(errorLog());
+  const std::string expected = "  Added rule: " + longName.substr(0, 2047 - 14) + "\n";
+  EXPECT_THAT(log, HasSubstr("\n" + expected));
+}
+
+TEST_F(DaemonTest, RulesTreeLoadsEveryRulesFileAtAnyDepth) {
+  const std::string types = "<array><string>a.b</string></array>";
+  dir.write("tree/one.plist", RulesFile({RuleXml("one", types)}));
+  dir.write("tree/nested/deeper/two.plist",
+            RulesFile({RuleXml("two", "<array><string>a.b</string><string>c</string></array>")}));
+  dir.write("tree/.hidden/three.plist", RulesFile({RuleXml("three", types)}));
+  dir.write("tree/.four.plist", RulesFile({RuleXml("four", types)}));
+  dir.write("tree/notes.txt", "not a property list");
+  dir.write("tree/dict.plist", PlistDocument("<dict><key>name</key><string>x</string></dict>"));
+  dir.write("tree/mixed.plist",
+            RulesFile({RuleXml("disabled", types, "<key>enabled</key><false/>"),
+                       RuleXml("stringTypes", "<string>a.b</string>"), "<string>junk</string>",
+                       RuleXml("twice", "<array><string>d</string><string>d</string></array>"),
+                       RuleXml("none", "<array/>")}));
+  const std::string config = writeConfig({{"debugLevel", "<integer>3</integer>"}});
+  Daemon daemon({"-c", config, "-r", dir.file("tree")}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+  EXPECT_EQ(daemon.stop(SIGINT), 0);
+  const std::string log = ReadFile(errorLog());
+  // one, two, three, four, twice and none; the disabled rule and the string-typed one are not.
+  EXPECT_THAT(log, HasSubstr("Loaded 6 rules\n"));
+  EXPECT_THAT(log, HasSubstr("  Skipping disabled rule: disabled\n"));
+  EXPECT_THAT(log, Not(HasSubstr("stringTypes")));
+  EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("tree/notes.txt"))));
+  EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("tree/dict.plist"))));
+  EXPECT_THAT(log, HasSubstr("  Added rule: twice\n  Added rule: twice\n"));
+  EXPECT_THAT(log, HasSubstr("  Added rule: two\n  Added rule: two\n"));
+  EXPECT_THAT(log, HasSubstr("LOADING RULES (" + dir.file("tree/.hidden/three.plist") + ")"));
+  EXPECT_THAT(log, HasSubstr("Velkin Shutdown at"));
+}
+
+TEST_F(DaemonTest, SingleRulesFileIsChosenByItsExtension) {
+  const std::string config = writeConfig();
+  const std::string rules = writeOneRule();
+  Daemon daemon({"-c", config, "-r", rules, "-v", "1"}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Loaded 1 rules"));
+  EXPECT_EQ(daemon.stop(SIGTERM), 0);
+  const std::string log = ReadFile(errorLog());
+  EXPECT_EQ(log.substr(log.rfind('\n', log.size() - 2) + 1).rfind("Velkin Shutdown at ", 0), 0u);
+
+  // A directory whose name has an extension is read as a single file: no rules.
+  mkdir(dir.file("my.rules").c_str(), 0755);
+  dir.write("my.rules/a.plist", RulesFile({RuleXml("r", "<array><string>x</string></array>")}));
+  EXPECT_EQ(run({"-c", config, "-r", dir.file("my.rules")}).status, 0);
+  EXPECT_THAT(ReadFile(errorLog()), HasSubstr("No rules found in " + dir.file("my.rules")));
+}
+
+TEST_F(DaemonTest, SigusrOneIsIgnored) {
+  const std::string config = writeConfig();
+  const std::string rules = writeOneRule();
+  Daemon daemon({"-c", config, "-r", rules, "-v", "1"}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+  kill(daemon.pid(), SIGUSR1);
+  usleep(200 * 1000);
+  EXPECT_TRUE(daemon.running());
+  EXPECT_EQ(daemon.stop(SIGTERM), 0);
+}
+
+// The fixed log directory is checked only inside a private mount namespace with a tmpfs over
+// /var/log, so the machine's own logs are never touched.
+class VelkinDirectoryTest : public DaemonTest {
+ protected:
+  // Runs setup and then tarvod in the namespace; prints "status=N" and the probe's output.
+  RunResult runInNamespace(const std::string& setup, const std::string& probe) {
+    const std::string config = dir.write(
+        "velkin.plist", ConfigPlist({{"errorLogPath", String("/var/log/velkin/tarvod.log")}}));
+    const std::string script = "mount -t tmpfs tmpfs /var/log || exit 99; umask 022; " + setup +
+                               "; '" + TarvodBinary() + "' -c '" + config + "' -r '" +
+                               dir.file("missing") + "'; echo status=$?; " + probe;
+    return RunProgram({"/usr/bin/unshare", "-m", "--propagation", "private", "/bin/sh", "-c",
+                       script});
+  }
+};
+
+TEST_F(VelkinDirectoryTest, MissingDirectoryIsCreated) {
+  const RunResult r = runInNamespace(
+      "true", "stat -c '%a %F' /var/log/velkin; stat -c '%a' /var/log/velkin/tarvod.log");
+  if (r.status == 99 || r.status == 127) GTEST_SKIP() << "no mount namespace here: " << r.err;
+  EXPECT_THAT(r.out, HasSubstr("status=0\n755 directory\n600\n"));
+}
+
+TEST_F(VelkinDirectoryTest, RegularFileOrLinkInItsPlaceFailsStartup) {
+  for (const std::string setup : {"touch /var/log/velkin", "mkdir /var/log/real; ln -s /var/log/real /var/log/velkin"}) {
+    const RunResult r = runInNamespace(setup, "true");
+    if (r.status == 99 || r.status == 127) GTEST_SKIP() << "no mount namespace here: " << r.err;
+    EXPECT_THAT(r.out, HasSubstr("status=255"));
+    EXPECT_THAT(r.err, HasSubstr("/var/log/velkin is not a directory"));
+  }
+}
+
+}  // namespace
+}  // namespace tarvod::testing

@@ -1,0 +1,259 @@
+#include "harness.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <thread>
+
+namespace tarvod::testing {
+
+namespace fs = std::filesystem;
+
+std::string ReadFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::ostringstream buffer;
+  buffer << in.rdbuf();
+  return buffer.str();
+}
+
+void WriteFile(const std::string& path, std::string_view content) {
+  fs::create_directories(fs::path(path).parent_path());
+  std::ofstream out(path, std::ios::binary | std::ios::trunc);
+  out.write(content.data(), static_cast<std::streamsize>(content.size()));
+}
+
+bool FileExists(const std::string& path) {
+  struct stat st {};
+  return lstat(path.c_str(), &st) == 0;
+}
+
+TempDir::TempDir() {
+  char pattern[] = "/tmp/tarvod-test-XXXXXX";
+  const char* made = mkdtemp(pattern);
+  mPath = made ? made : "/tmp/tarvod-test-failed";
+  chmod(mPath.c_str(), 0755);  // senders under other identities must reach sockets inside
+}
+
+TempDir::~TempDir() {
+  std::error_code ignored;
+  fs::remove_all(mPath, ignored);
+}
+
+std::string TempDir::write(std::string_view name, std::string_view content) const {
+  const std::string path = file(name);
+  WriteFile(path, content);
+  return path;
+}
+
+std::string TarvodBinary() {
+  if (const char* env = std::getenv("TARVOD_BINARY")) return env;
+  return TARVOD_BINARY_PATH;
+}
+
+std::string TarvodctlBinary() {
+  if (const char* env = std::getenv("TARVODCTL_BINARY")) return env;
+  return TARVODCTL_BINARY_PATH;
+}
+
+std::string PlistDocument(std::string_view bodyXml) {
+  std::string doc =
+      "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
+      "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
+      "\"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
+      "<plist version=\"1.0\">\n";
+  doc += bodyXml;
+  doc += "\n</plist>\n";
+  return doc;
+}
+
+std::string ConfigPlist(const std::vector<std::pair<std::string, std::string>>& config,
+                        std::string_view initialGlobalsXml) {
+  std::string body = "<dict>\n<key>config</key>\n<dict>\n";
+  for (const auto& [key, xml] : config) body += "<key>" + key + "</key>" + xml + "\n";
+  body += "</dict>\n";
+  if (!initialGlobalsXml.empty()) {
+    body += "<key>initialGlobals</key>\n";
+    body += initialGlobalsXml;
+    body += "\n";
+  }
+  body += "</dict>";
+  return PlistDocument(body);
+}
+
+namespace {
+
+std::vector<char*> Argv(const std::vector<std::string>& args) {
+  std::vector<char*> argv;
+  for (const auto& a : args) argv.push_back(const_cast<char*>(a.c_str()));
+  argv.push_back(nullptr);
+  return argv;
+}
+
+// Waits for pid with a deadline; returns the decoded status, or -1 on timeout.
+int WaitWithTimeout(pid_t pid, std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  for (;;) {
+    int status = 0;
+    const pid_t r = waitpid(pid, &status, WNOHANG);
+    if (r == pid) {
+      if (WIFEXITED(status)) return WEXITSTATUS(status);
+      if (WIFSIGNALED(status)) return 128 + WTERMSIG(status);
+      return -1;
+    }
+    if (r < 0 && errno != EINTR) return -1;
+    if (std::chrono::steady_clock::now() > deadline) return -1;
+    std::this_thread::sleep_for(5ms);
+  }
+}
+
+void DrainInto(int fd, std::string& out) {
+  char buffer[4096];
+  for (;;) {
+    const ssize_t n = read(fd, buffer, sizeof buffer);
+    if (n <= 0) return;
+    out.append(buffer, static_cast<size_t>(n));
+  }
+}
+
+}  // namespace
+
+RunResult RunProgram(const std::vector<std::string>& argv, std::string_view stdinText,
+                     std::chrono::milliseconds timeout) {
+  RunResult result;
+  int in[2], out[2], err[2];
+  if (pipe2(in, O_CLOEXEC) != 0 || pipe2(out, O_CLOEXEC) != 0 || pipe2(err, O_CLOEXEC) != 0) {
+    return result;
+  }
+  const pid_t pid = fork();
+  if (pid == 0) {
+    dup2(in[0], 0);
+    dup2(out[1], 1);
+    dup2(err[1], 2);
+    auto args = Argv(argv);
+    execv(args[0], args.data());
+    _exit(127);
+  }
+  close(in[0]);
+  close(out[1]);
+  close(err[1]);
+  // The input is small in every test; write it all, then close.
+  size_t written = 0;
+  while (written < stdinText.size()) {
+    const ssize_t n = write(in[1], stdinText.data() + written, stdinText.size() - written);
+    if (n <= 0) break;
+    written += static_cast<size_t>(n);
+  }
+  close(in[1]);
+  fcntl(out[0], F_SETFL, O_NONBLOCK);
+  fcntl(err[0], F_SETFL, O_NONBLOCK);
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  for (;;) {
+    pollfd fds[2] = {{out[0], POLLIN, 0}, {err[0], POLLIN, 0}};
+    poll(fds, 2, 20);
+    DrainInto(out[0], result.out);
+    DrainInto(err[0], result.err);
+    int status = 0;
+    if (waitpid(pid, &status, WNOHANG) == pid) {
+      DrainInto(out[0], result.out);
+      DrainInto(err[0], result.err);
+      result.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+      break;
+    }
+    if (std::chrono::steady_clock::now() > deadline) {
+      kill(pid, SIGKILL);
+      waitpid(pid, &status, 0);
+      result.status = -1;
+      break;
+    }
+  }
+  close(out[0]);
+  close(err[0]);
+  return result;
+}
+
+Daemon::Daemon(const std::vector<std::string>& args, const TempDir& dir) {
+  mStderrPath = dir.file("daemon.stderr");
+  const std::string stdoutPath = dir.file("daemon.stdout");
+  std::vector<std::string> full{TarvodBinary()};
+  full.insert(full.end(), args.begin(), args.end());
+  mPid = fork();
+  if (mPid == 0) {
+    const int out = open(stdoutPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    const int err = open(mStderrPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    if (out >= 0) dup2(out, 1);
+    if (err >= 0) dup2(err, 2);
+    const int null = open("/dev/null", O_RDONLY);
+    if (null >= 0) dup2(null, 0);
+    auto argv = Argv(full);
+    execv(argv[0], argv.data());
+    _exit(127);
+  }
+}
+
+Daemon::~Daemon() {
+  if (mPid > 0 && mStatus < 0) {
+    kill(mPid, SIGKILL);
+    int status = 0;
+    waitpid(mPid, &status, 0);
+  }
+}
+
+bool Daemon::running() {
+  if (mStatus >= 0) return false;
+  int status = 0;
+  if (waitpid(mPid, &status, WNOHANG) == mPid) {
+    mStatus = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    return false;
+  }
+  return true;
+}
+
+bool Daemon::waitForLine(const std::string& file, std::string_view text,
+                         std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  for (;;) {
+    if (ReadFile(file).find(text) != std::string::npos) return true;
+    if (!running()) return ReadFile(file).find(text) != std::string::npos;
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(10ms);
+  }
+}
+
+int Daemon::stop(int signal, std::chrono::milliseconds timeout) {
+  if (running()) kill(mPid, signal);
+  return wait(timeout);
+}
+
+int Daemon::wait(std::chrono::milliseconds timeout) {
+  if (mStatus >= 0) return mStatus;
+  const int status = WaitWithTimeout(mPid, timeout);
+  if (status >= 0) mStatus = status;
+  return status;
+}
+
+std::string Daemon::stderrText() const { return ReadFile(mStderrPath); }
+
+namespace {
+long StatusField(pid_t pid, std::string_view field) {
+  std::istringstream in(ReadFile("/proc/" + std::to_string(pid) + "/status"));
+  std::string line;
+  while (std::getline(in, line)) {
+    if (line.rfind(field, 0) == 0) return std::strtol(line.c_str() + field.size(), nullptr, 10);
+  }
+  return -1;
+}
+}  // namespace
+
+long ResidentKb(pid_t pid) { return StatusField(pid, "VmRSS:"); }
+long PeakResidentKb(pid_t pid) { return StatusField(pid, "VmHWM:"); }
+
+}  // namespace tarvod::testing

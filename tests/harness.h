@@ -1,0 +1,89 @@
+// Helpers for integration tests that run the real tarvod binary: temporary directories,
+// files, child processes and waiting for log lines. Test-thread only.
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <csignal>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace tarvod::testing {
+
+using namespace std::chrono_literals;
+
+std::string ReadFile(const std::string& path);
+void WriteFile(const std::string& path, std::string_view content);
+bool FileExists(const std::string& path);
+
+// A fresh directory under /tmp, removed with everything in it at the end of the test.
+class TempDir {
+ public:
+  TempDir();
+  ~TempDir();
+  TempDir(const TempDir&) = delete;
+  TempDir& operator=(const TempDir&) = delete;
+
+  const std::string& path() const { return mPath; }
+  std::string file(std::string_view name) const { return mPath + "/" + std::string(name); }
+  // Writes a file (creating parent directories) and returns its full path.
+  std::string write(std::string_view name, std::string_view content) const;
+  std::string read(std::string_view name) const { return ReadFile(file(name)); }
+
+ private:
+  std::string mPath;
+};
+
+std::string TarvodBinary();
+std::string TarvodctlBinary();
+
+// An XML property list with a "config" dictionary built from XML fragments, for example
+// ConfigPlist({{"errorLogPath", "<string>/tmp/x</string>"}}).
+std::string ConfigPlist(const std::vector<std::pair<std::string, std::string>>& config,
+                        std::string_view initialGlobalsXml = {});
+// Wraps dictionary/array XML in a plist document.
+std::string PlistDocument(std::string_view bodyXml);
+
+struct RunResult {
+  int status = -1;  // exit status, or 128 + signal
+  std::string out;
+  std::string err;
+};
+// Runs a program to completion (killed after timeout) and collects its output.
+RunResult RunProgram(const std::vector<std::string>& argv, std::string_view stdinText = {},
+                     std::chrono::milliseconds timeout = 30s);
+
+// A running tarvod. The destructor kills it if it is still running.
+class Daemon {
+ public:
+  // Starts the binary with args (argv[0] is added); stdout and stderr go to files in dir.
+  Daemon(const std::vector<std::string>& args, const TempDir& dir);
+  ~Daemon();
+  Daemon(const Daemon&) = delete;
+  Daemon& operator=(const Daemon&) = delete;
+
+  pid_t pid() const { return mPid; }
+  // Waits until the file contains text; false on timeout or when the daemon exited first
+  // without writing it.
+  bool waitForLine(const std::string& file, std::string_view text,
+                   std::chrono::milliseconds timeout = 15s);
+  // Sends the signal and waits for the exit status (128 + signal when killed by one).
+  int stop(int signal = SIGTERM, std::chrono::milliseconds timeout = 20s);
+  // Waits for the daemon to exit by itself.
+  int wait(std::chrono::milliseconds timeout = 20s);
+  bool running();
+  std::string stderrText() const;
+
+ private:
+  pid_t mPid = -1;
+  int mStatus = -1;
+  std::string mStderrPath;
+};
+
+// Resident set size of a process in kB (VmRSS), and its peak (VmHWM); -1 when unknown.
+long ResidentKb(pid_t pid);
+long PeakResidentKb(pid_t pid);
+
+}  // namespace tarvod::testing
