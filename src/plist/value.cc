@@ -27,6 +27,7 @@ DictionaryBox& DictionaryBox::operator=(DictionaryBox&& other) noexcept {
   return *this;
 }
 DictionaryBox::~DictionaryBox() = default;
+bool DictionaryBox::operator==(const DictionaryBox& other) const { return *p_ == *other.p_; }
 }  // namespace internal
 
 Value::Value(Dictionary d) : v_(internal::DictionaryBox(std::move(d))) {}

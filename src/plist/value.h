@@ -40,6 +40,7 @@ class DictionaryBox {
   ~DictionaryBox();
   Dictionary& get() { return *p_; }
   const Dictionary& get() const { return *p_; }
+  bool operator==(const DictionaryBox& other) const;
 
  private:
   std::unique_ptr<Dictionary> p_;
