@@ -1,0 +1,246 @@
+#include "sources/event_listener.h"
+
+#include <sys/epoll.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <string_view>
+
+#include "platform/diagnostic_log.h"
+#include "platform/event_loop.h"
+#include "plist/codec.h"
+#include "sources/monitor.h"
+
+namespace tarvod {
+namespace {
+
+constexpr int kListenBacklog = 128;
+// After accept fails for want of descriptors, accepting pauses this long instead of spinning.
+constexpr uint64_t kAcceptBackoffMicroseconds = 100'000;
+
+// The wire carries XML and binary property lists only; the old-style text form (which would
+// read almost any bytes as a string) is not a message format.
+bool LooksLikeWireFormat(std::string_view bytes) {
+  if (bytes.starts_with("bplist")) return true;
+  if (bytes.starts_with("\xEF\xBB\xBF")) bytes.remove_prefix(3);
+  while (!bytes.empty() && (bytes.front() == ' ' || bytes.front() == '\t' ||
+                            bytes.front() == '\r' || bytes.front() == '\n')) {
+    bytes.remove_prefix(1);
+  }
+  return bytes.starts_with("<");
+}
+
+// The IDs as the messages print them: "%d" of the 32-bit value.
+int AsPrinted(uint32_t id) { return static_cast<int32_t>(id); }
+
+}  // namespace
+
+std::optional<plist::Dictionary> ConvertXPCEvent(const plist::Dictionary& message, uint32_t uid,
+                                                 uint32_t gid) {
+  LogMessage(3, "\tdictionary count = %d", static_cast<int>(message.size()));
+  if (DebugLevel() >= 3) LogMessage(3, "event: %s:", plist::Describe(message).c_str());
+  plist::Dictionary event = message;
+  if (!event.contains("senderUID")) event.set("senderUID", std::to_string(AsPrinted(uid)));
+  if (!event.contains("senderGID")) event.set("senderGID", std::to_string(AsPrinted(gid)));
+  return event;
+}
+
+// ---- PeerConnections ----
+
+struct PeerConnections::Peer {
+  uint64_t id = 0;
+  int fd = -1;
+  PeerCredentials credentials;
+  std::unique_ptr<IoSource> source;
+  bool cancelled = false;
+
+  ~Peer() {
+    source.reset();  // stop watching before the descriptor goes
+    if (fd >= 0) close(fd);
+  }
+};
+
+PeerConnections::PeerConnections(Monitor& monitor, EventLoop& queue)
+    : mMonitor(monitor), mQueue(queue), mBuffer(kMaxEventMessageBytes) {}
+
+PeerConnections::~PeerConnections() = default;
+
+void PeerConnections::add(int fd, const PeerCredentials& credentials) {
+  auto peer = std::make_unique<Peer>();
+  peer->id = mNextId++;
+  peer->fd = fd;
+  peer->credentials = credentials;
+  Peer* raw = peer.get();
+  peer->source = mQueue.addIo(fd, EPOLLIN | EPOLLRDHUP, /*gated=*/true,
+                              [this, raw](uint32_t events) { onReadable(*raw, events); });
+  if (!peer->source) {
+    LogMessage(4, "unexpected peer error");
+    return;  // the descriptor closes with the peer
+  }
+  mPeers.emplace(peer->id, std::move(peer));
+}
+
+void PeerConnections::onReadable(Peer& peer, uint32_t events) {
+  if (peer.cancelled) return;
+  size_t length = 0;
+  switch (ReceivePacket(peer.fd, mBuffer, &length)) {
+    case ReceiveStatus::kWouldBlock:
+      return;
+    case ReceiveStatus::kError:
+      LogMessage(4, "peer error: %s", std::strerror(static_cast<int>(length)));
+      cancel(peer);
+      return;
+    case ReceiveStatus::kEmpty:
+      if (events & (EPOLLHUP | EPOLLRDHUP | EPOLLERR)) {
+        LogMessage(4, "peer error: %s", "Connection invalid");
+        cancel(peer);
+        return;
+      }
+      break;  // an empty packet: no property list
+    case ReceiveStatus::kOversize:
+      length = 0;  // nothing of it was kept
+      break;
+    case ReceiveStatus::kMessage:
+      break;
+  }
+  handleMessage(peer, length);
+}
+
+void PeerConnections::handleMessage(Peer& peer, size_t length) {
+  const int uid = AsPrinted(peer.credentials.uid);
+  const int gid = AsPrinted(peer.credentials.gid);
+  const std::string_view bytes(reinterpret_cast<const char*>(mBuffer.data()), length);
+  std::optional<plist::Value> message;
+  if (length > 0 && LooksLikeWireFormat(bytes)) message = plist::ReadPropertyList(bytes);
+
+  if (!message) {
+    LogMessage(3, "_CFXPCCreateCFObjectFromXPCObject returned NULL");
+    LogMessage(3, "XPC Malformed event received from %d:%d (uid:gid)", uid, gid);
+    return;
+  }
+  const plist::Dictionary* dictionary = message->asDictionary();
+  if (dictionary == nullptr) {
+    LogMessage(4, "unexpected peer event: %s", plist::Describe(*message).c_str());
+    cancel(peer);
+    return;
+  }
+  std::optional<plist::Dictionary> event =
+      ConvertXPCEvent(*dictionary, peer.credentials.uid, peer.credentials.gid);
+  if (!event) {
+    LogMessage(3, "XPC Malformed event received from %d:%d (uid:gid)", uid, gid);
+    return;
+  }
+  if (DebugLevel() >= 3) LogMessage(3, "XPC Event received: %s ", plist::Describe(*event).c_str());
+  mMonitor.processEvent(*event);
+  mMonitor.applyBackPressure();
+}
+
+void PeerConnections::cancel(Peer& peer) {
+  // The peer's own handler is running: stop it now, free it once the handler has returned.
+  peer.cancelled = true;
+  peer.source->setEnabled(false);
+  const uint64_t id = peer.id;
+  mQueue.post([this, id, alive = std::weak_ptr<int>(mLifetime)] {
+    if (alive.expired()) return;
+    mPeers.erase(id);
+    if (mSlotFreed) mSlotFreed();
+  });
+}
+
+// ---- EventListener ----
+
+std::unique_ptr<EventListener> EventListener::Create(Monitor& monitor, EventLoop& queue,
+                                                     PeerConnections& peers,
+                                                     const std::string& path) {
+  SocketResult socket = ListenSeqpacket(path, kListenBacklog);
+  if (socket.fd < 0) {
+    LogMessage(2, "SetXPCListenerFor: %s", socket.error.c_str());
+    return nullptr;
+  }
+  std::unique_ptr<EventListener> listener(
+      new EventListener(monitor, queue, peers, path, std::move(socket)));
+  listener->mSource = queue.addIo(listener->mSocket.fd, EPOLLIN, /*gated=*/true,
+                                  [raw = listener.get()](uint32_t) { raw->onAcceptable(); });
+  if (!listener->mSource) {
+    LogMessage(2, "SetXPCListenerFor: cannot watch %s", path.c_str());
+    return nullptr;
+  }
+  peers.setSlotFreedHandler([raw = listener.get()] { raw->updateAccepting(); });
+  return listener;
+}
+
+EventListener::EventListener(Monitor& monitor, EventLoop& queue, PeerConnections& peers,
+                             std::string path, SocketResult socket)
+    : mMonitor(monitor),
+      mQueue(queue),
+      mPeers(peers),
+      mPath(std::move(path)),
+      mSocket(std::move(socket)) {}
+
+EventListener::~EventListener() {
+  mPeers.setSlotFreedHandler(nullptr);
+  mSource.reset();
+  if (mSocket.fd >= 0) {
+    RemoveSeqpacketPath(mPath, mSocket);
+    close(mSocket.fd);
+  }
+}
+
+void EventListener::suspend() {
+  mSuspended = true;
+  updateAccepting();
+}
+
+void EventListener::resume() {
+  mSuspended = false;
+  updateAccepting();
+}
+
+void EventListener::updateAccepting() {
+  if (mSource) mSource->setEnabled(!mSuspended && !mBackingOff && !mPeers.full());
+}
+
+void EventListener::onAcceptable() {
+  if (mPeers.full()) {
+    updateAccepting();  // waits for a slot
+    return;
+  }
+  const int fd = AcceptSeqpacket(mSocket.fd);
+  if (fd < 0) {
+    const int error = errno;
+    if (error == EAGAIN || error == EWOULDBLOCK || error == EINTR || error == ECONNABORTED) {
+      return;
+    }
+    LogMessage(2, "unexpected connection error: %s", std::strerror(error));
+    if (error == EMFILE || error == ENFILE || error == ENOBUFS || error == ENOMEM) {
+      mBackingOff = true;
+      updateAccepting();
+      mQueue.callLater(kAcceptBackoffMicroseconds, [this, alive = std::weak_ptr<int>(mLifetime)] {
+        if (alive.expired()) return;
+        mBackingOff = false;
+        updateAccepting();
+      });
+    }
+    return;
+  }
+  LogMessage(3, "XPC Connection EventHandler called");
+  PeerCredentials credentials;
+  if (!ReadPeerCredentials(fd, &credentials)) {
+    LogMessage(2, "unexpected connection error: %s", std::strerror(errno));
+    close(fd);
+    return;
+  }
+  const int uid = AsPrinted(credentials.uid);
+  const int gid = AsPrinted(credentials.gid);
+  LogMessage(3, "XPC Connection Request recieved from %d:%d (uid:gid)", uid, gid);
+  if (!mMonitor.filterBySourceUID(credentials.uid, credentials.gid)) {
+    close(fd);
+    LogMessage(3, "XPC Event rejected from %d:%d (uid:gid)", uid, gid);
+    return;
+  }
+  mPeers.add(fd, credentials);
+  if (mPeers.full()) updateAccepting();
+}
+
+}  // namespace tarvod

@@ -1,0 +1,230 @@
+#include "sources/event_listener.h"
+
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+#include <fstream>
+#include <memory>
+
+#include "platform/event_loop.h"
+#include "sources/monitor.h"
+#include "sources/test_sink.h"
+
+namespace tarvod {
+namespace {
+
+using testing::Client;
+using testing::EventCollector;
+using testing::EventXml;
+using testing::XmlPlist;
+
+class EventSocketTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/tarvod-listener-XXXXXX";
+    ASSERT_NE(mkdtemp(pattern), nullptr);
+    mDirectory = pattern;
+    mPath = mDirectory + "/run/evtq";
+  }
+  void TearDown() override {
+    mMonitor.reset();
+    std::filesystem::remove_all(mDirectory);
+  }
+  Monitor& start(std::atomic<size_t>* backlog = nullptr) {
+    mMonitor = std::make_unique<Monitor>(
+        std::make_shared<Rulebase>(), std::make_shared<VariableStore>(), mCollector.hooks(backlog));
+    mMonitor->setEventSocketPath(mPath);
+    mMonitor->beginListening();
+    return *mMonitor;
+  }
+  // Round trips through the input queue, so that what it could read has been read.
+  void settle() {
+    for (int i = 0; i < 20; ++i) mMonitor->inputQueue()->sync([] {});
+  }
+
+  std::string mDirectory;
+  std::string mPath;
+  EventCollector mCollector;
+  std::unique_ptr<Monitor> mMonitor;
+};
+
+TEST(ConvertXPCEvent, StampsSenderIdsAsSignedDecimalUnlessTheSenderSetThem) {
+  const auto stamped = ConvertXPCEvent({{"eventType", "x"}}, 4294967294u, 20);
+  ASSERT_TRUE(stamped);
+  EXPECT_EQ(*stamped->findString("senderUID"), "-2");
+  EXPECT_EQ(*stamped->findString("senderGID"), "20");
+
+  const auto kept = ConvertXPCEvent({{"eventType", "x"}, {"senderUID", "forged"}}, 501, 20);
+  ASSERT_TRUE(kept);
+  EXPECT_EQ(*kept->findString("senderUID"), "forged");
+  EXPECT_EQ(*kept->findString("senderGID"), "20");
+}
+
+TEST_F(EventSocketTest, SocketIsCreatedWithItsDirectoryAndOpenToEveryone) {
+  start();
+  struct stat socketStat, directoryStat;
+  ASSERT_EQ(lstat(mPath.c_str(), &socketStat), 0);
+  EXPECT_TRUE(S_ISSOCK(socketStat.st_mode));
+  EXPECT_EQ(socketStat.st_mode & 0777, 0666u);
+  ASSERT_EQ(stat((mDirectory + "/run").c_str(), &directoryStat), 0);
+  EXPECT_EQ(directoryStat.st_mode & 0777, 0755u);
+  mMonitor->stopListening();
+  EXPECT_FALSE(std::filesystem::exists(mPath)) << "the socket file is removed at stop";
+}
+
+TEST_F(EventSocketTest, ThreeMessagesOnOneConnectionAreThreeEventsWithTheSameSender) {
+  start();
+  Client client(mPath);
+  ASSERT_TRUE(client.connected());
+  for (const char* type : {"a.one", "a.two", "a.three"}) ASSERT_TRUE(client.send(EventXml(type)));
+  ASSERT_TRUE(mCollector.waitFor(3));
+  const auto events = mCollector.events();
+  EXPECT_EQ(*events[0].findString("eventType"), "a.one");
+  EXPECT_EQ(*events[2].findString("eventType"), "a.three");
+  for (const auto& event : events) {
+    EXPECT_EQ(*event.findString("senderUID"), std::to_string(getuid()));
+    EXPECT_EQ(*event.findString("senderGID"), std::to_string(getgid()));
+  }
+}
+
+TEST_F(EventSocketTest, MalformedAndOversizePacketsAreDroppedAndTheConnectionStays) {
+  start();
+  Client client(mPath);
+  ASSERT_TRUE(client.send("this is no property list"));
+  ASSERT_TRUE(client.send(""));
+  ASSERT_TRUE(client.send("<plist><dict><key>unterminated"));
+  std::string oversize = EventXml(
+      "too.big", "<key>pad</key><string>" + std::string(kMaxEventMessageBytes, 'p') + "</string>");
+  ASSERT_TRUE(client.send(oversize));
+  ASSERT_TRUE(client.send(EventXml("after.malformed")));
+  ASSERT_TRUE(mCollector.waitFor(1));
+  settle();
+  const auto events = mCollector.events();
+  ASSERT_EQ(events.size(), 1u);
+  EXPECT_EQ(*events[0].findString("eventType"), "after.malformed");
+}
+
+TEST_F(EventSocketTest, ANonDictionaryMessageClosesTheConnection) {
+  start();
+  Client client(mPath);
+  ASSERT_TRUE(client.send(XmlPlist("<string>just text</string>")));
+  // The daemon closes its end: a read on ours sees the end of the stream.
+  char byte;
+  EXPECT_EQ(recv(client.fd(), &byte, 1, 0), 0);
+  Client other(mPath);
+  ASSERT_TRUE(other.send(EventXml("still.listening")));
+  ASSERT_TRUE(mCollector.waitFor(1));
+  EXPECT_EQ(mCollector.size(), 1u);
+}
+
+TEST_F(EventSocketTest, ADictionaryWithoutEventTypeIsPassedOn) {
+  start();
+  Client client(mPath);
+  ASSERT_TRUE(client.send(XmlPlist("<dict><key>note</key><string>n</string></dict>")));
+  ASSERT_TRUE(mCollector.waitFor(1));
+  EXPECT_FALSE(mCollector.events()[0].contains("eventType"));
+}
+
+TEST_F(EventSocketTest, AStaleSocketFileIsReplaced) {
+  std::filesystem::create_directories(mDirectory + "/run");
+  {
+    SocketResult stale = ListenSeqpacket(mPath, 1);
+    ASSERT_GE(stale.fd, 0);
+    close(stale.fd);  // the file stays behind, as after a crash
+  }
+  start();
+  Client client(mPath);
+  ASSERT_TRUE(client.send(EventXml("after.stale")));
+  EXPECT_TRUE(mCollector.waitFor(1));
+}
+
+TEST_F(EventSocketTest, APathHoldingSomethingElseIsLeftAloneAndTheListenerFails) {
+  std::filesystem::create_directories(mDirectory + "/run");
+  std::ofstream(mPath) << "precious";
+  Monitor& monitor = start();
+  EXPECT_EQ(monitor.SetXPCListenerFor(*monitor.inputQueue()), -1);
+  std::ifstream in(mPath);
+  std::string content;
+  in >> content;
+  EXPECT_EQ(content, "precious");
+}
+
+TEST_F(EventSocketTest, ASocketAnotherProcessListensOnIsNotTakenOver) {
+  std::filesystem::create_directories(mDirectory + "/run");
+  SocketResult live = ListenSeqpacket(mPath, 1);
+  ASSERT_GE(live.fd, 0);
+  Monitor& monitor = start();
+  EXPECT_EQ(monitor.SetXPCListenerFor(*monitor.inputQueue()), -1);
+  close(live.fd);
+}
+
+TEST_F(EventSocketTest, ConnectionsBeyondTheLimitWaitUntilOneCloses) {
+  start();
+  std::vector<std::unique_ptr<Client>> clients;
+  for (size_t i = 0; i < kMaxPeerConnections; ++i) {
+    clients.push_back(std::make_unique<Client>(mPath));
+    ASSERT_TRUE(clients.back()->send(EventXml("first")));
+  }
+  ASSERT_TRUE(mCollector.waitFor(kMaxPeerConnections));
+  // Connecting succeeds (the kernel queues it), but the connection is not served yet.
+  Client waiting(mPath);
+  ASSERT_TRUE(waiting.connected());
+  ASSERT_TRUE(waiting.send(EventXml("waiting")));
+  ASSERT_TRUE(clients[1]->send(EventXml("served")));
+  ASSERT_TRUE(mCollector.waitFor(kMaxPeerConnections + 1));
+  settle();
+  EXPECT_EQ(*mCollector.events().back().findString("eventType"), "served");
+  EXPECT_EQ(mCollector.size(), kMaxPeerConnections + 1);
+
+  clients[0].reset();
+  ASSERT_TRUE(mCollector.waitFor(kMaxPeerConnections + 2));
+  EXPECT_EQ(*mCollector.events().back().findString("eventType"), "waiting");
+}
+
+TEST_F(EventSocketTest, ReadingStopsWhileTheProcessingBacklogIsOverItsLimit) {
+  std::atomic<size_t> backlog{kBackPressureHighJobs + 1};
+  start(&backlog);
+  Client client(mPath);
+  ASSERT_TRUE(client.send(EventXml("first")));
+  ASSERT_TRUE(mCollector.waitFor(1));
+  ASSERT_TRUE(client.send(EventXml("held")));
+  settle();
+  EXPECT_EQ(mCollector.size(), 1u) << "nothing is read while the backlog is high";
+  backlog = kBackPressureLowJobs;
+  ASSERT_TRUE(mCollector.waitFor(2));
+  EXPECT_EQ(*mCollector.events()[1].findString("eventType"), "held");
+}
+
+TEST_F(EventSocketTest, SuspendStopsAcceptingButServesAcceptedConnections) {
+  Monitor& monitor = start();
+  Client early(mPath);
+  ASSERT_TRUE(early.send(EventXml("early")));
+  ASSERT_TRUE(mCollector.waitFor(1));
+  monitor.suspend();
+  Client late(mPath);
+  ASSERT_TRUE(late.send(EventXml("late")));
+  ASSERT_TRUE(early.send(EventXml("early.again")));
+  ASSERT_TRUE(mCollector.waitFor(2));
+  settle();
+  EXPECT_EQ(mCollector.size(), 2u);
+  monitor.resume();
+  ASSERT_TRUE(mCollector.waitFor(3));
+  EXPECT_EQ(*mCollector.events()[2].findString("eventType"), "late");
+}
+
+TEST_F(EventSocketTest, StopListeningDeliversWhatWasReadAndKeepsAcceptedConnections) {
+  Monitor& monitor = start();
+  Client client(mPath);
+  for (int i = 0; i < 50; ++i) ASSERT_TRUE(client.send(EventXml("before.stop")));
+  ASSERT_TRUE(mCollector.waitFor(50));
+  monitor.stopListening();
+  EXPECT_FALSE(Client(mPath).connected());
+  ASSERT_TRUE(client.send(EventXml("after.stop")));
+  EXPECT_TRUE(mCollector.waitFor(51));
+}
+
+}  // namespace
+}  // namespace tarvod

@@ -1,0 +1,177 @@
+#include "sources/monitor.h"
+
+#include <vector>
+
+#include "platform/diagnostic_log.h"
+#include "platform/event_loop.h"
+#include "sources/audit_pipe.h"
+#include "sources/event_listener.h"
+
+namespace tarvod {
+namespace {
+
+constexpr const char* kInputQueueLabel = "com.quenta.tarvod.inputq";
+// How often a closed read gate looks at the backlog again.
+constexpr uint64_t kBacklogPollMicroseconds = 1000;
+
+}  // namespace
+
+std::optional<IdSet> ParseFilterList(std::optional<std::string_view> text) {
+  if (!text || text->empty()) return std::nullopt;
+  IdSet ids;
+  size_t start = 0;
+  for (;;) {
+    const size_t comma = text->find(',', start);
+    ids.insert(plist::LeadingInteger(text->substr(start, comma - start)));
+    if (comma == std::string_view::npos) break;
+    start = comma + 1;
+  }
+  return ids;
+}
+
+Monitor::Monitor(RulebasePtr rulebase, VariableStorePtr variables, MonitorHooks hooks)
+    : mRulebase(std::move(rulebase)),
+      mVariables(std::move(variables)),
+      mHooks(std::move(hooks)),
+      mEventSocketPath(kDefaultEventSocketPath) {}
+
+Monitor::~Monitor() {
+  if (!mInputEvtQ) return;
+  // Sources live on the input queue's thread and are destroyed there, before the queue.
+  mInputEvtQ->sync([this] {
+    mXPCEventConnection.reset();
+    mBSMReadSource.reset();
+    mPeers.reset();
+  });
+  mInputEvtQ.reset();
+}
+
+RulebasePtr Monitor::rulebase() const {
+  std::lock_guard<std::mutex> lock(mRulebaseLock);
+  return mRulebase;
+}
+
+void Monitor::setRulebase(RulebasePtr rulebase) {
+  std::lock_guard<std::mutex> lock(mRulebaseLock);
+  mRulebase = std::move(rulebase);
+}
+
+void Monitor::setEventFilterUID(std::optional<IdSet> uids, std::optional<IdSet> gids) {
+  mAllowedUIDs = std::move(uids);
+  mAllowedGIDs = std::move(gids);
+}
+
+bool Monitor::filterBySourceUID(uint32_t uid, uint32_t gid) const {
+  if (!mAllowedUIDs && !mAllowedGIDs) return true;
+  // The IDs are unsigned: a negative list entry never matches.
+  if (mAllowedUIDs && mAllowedUIDs->contains(int64_t{uid})) return true;
+  if (mAllowedGIDs && mAllowedGIDs->contains(int64_t{gid})) return true;
+  LogMessage(2, "Blocked event because user with ID %u is not in the allowed UID list", uid);
+  return false;
+}
+
+void Monitor::processEvent(const plist::Dictionary& event) {
+  if (DebugLevel() >= 3) LogMessage(3, "Event received: %s ", plist::Describe(event).c_str());
+  if (mHooks.dispatch) mHooks.dispatch(rulebase(), event, mVariables);
+}
+
+int Monitor::SetXPCListenerFor(EventLoop& queue) {
+  int result = -1;
+  queue.sync([&] {
+    if (!mPeers) mPeers = std::make_unique<PeerConnections>(*this, queue);
+    mXPCEventConnection = EventListener::Create(*this, queue, *mPeers, mEventSocketPath);
+    result = mXPCEventConnection ? 0 : -1;
+  });
+  return result;
+}
+
+void Monitor::beginListening() {
+  if (!mInputEvtQ) mInputEvtQ = std::make_unique<EventLoop>(kInputQueueLabel);
+
+  LogMessage(1, "Starting the New XPC event listener");
+  if (SetXPCListenerFor(*mInputEvtQ) != 0) {
+    LogMessage(1, "XPC event listener failed to start up");
+  }
+
+  LogMessage(1, "Opening the BSM Auditpipe");
+  int descriptor = -1;
+  uint64_t bufferSize = 0;
+  const int error = OpenAuditPipe(&descriptor, &bufferSize);
+  if (error != 0) {
+    LogMessage(0, "Failed to open the Auditpipe error = %d", error);
+    return;
+  }
+  mAuditpipe = descriptor;
+  mEventBufferSize = bufferSize;
+  LogMessage(1, "Starting the Auditpipe listener");
+  mInputEvtQ->sync([&] {
+    std::unique_ptr<AuditReadSource> source;
+    if (StartAuditPipeSource(mAuditpipe, mEventBufferSize, *this, *mInputEvtQ, &source) == 0) {
+      mBSMReadSource = std::move(source);
+    }
+  });
+}
+
+void Monitor::stopListening() {
+  if (!mInputEvtQ) return;
+  mInputEvtQ->sync([this] {
+    mXPCEventConnection.reset();
+    mBSMReadSource.reset();  // closes the pipe
+  });
+  // Every event already read on the input queue has been dispatched once this returns.
+  mInputEvtQ->sync([] {});
+  mAuditpipe = -1;
+  mEventBufferSize = 0;
+}
+
+void Monitor::suspend() {
+  if (!mInputEvtQ) return;
+  mInputEvtQ->sync([this] {
+    if (mXPCEventConnection) mXPCEventConnection->suspend();
+  });
+}
+
+void Monitor::resume() {
+  if (!mInputEvtQ) return;
+  mInputEvtQ->sync([this] {
+    if (mXPCEventConnection) mXPCEventConnection->resume();
+  });
+}
+
+void Monitor::applyBackPressure() {
+  if (!mHooks.backlog || !mInputEvtQ || !mInputEvtQ->isCurrentThread()) return;
+  if (!mInputEvtQ->readGateOpen() || mHooks.backlog() <= kBackPressureHighJobs) return;
+  mInputEvtQ->setReadGateOpen(false);
+  watchBacklog();
+}
+
+void Monitor::watchBacklog() {
+  const bool scheduled = mInputEvtQ->callLater(kBacklogPollMicroseconds, [this] {
+    if (mHooks.backlog() <= kBackPressureLowJobs) {
+      mInputEvtQ->setReadGateOpen(true);
+    } else {
+      watchBacklog();
+    }
+  });
+  // Without a timer the gate could never reopen: keep reading instead.
+  if (!scheduled) mInputEvtQ->setReadGateOpen(true);
+}
+
+int Monitor::runAuditpipeListener() {
+  if (mAuditpipe < 0) {
+    LogMessage(3, "BSM listener failure errno = %d", EBADF);
+    return -1;
+  }
+  std::vector<uint8_t> record;
+  for (;;) {
+    const int error = ReadAuditRecord(mAuditpipe, &record);
+    if (error != 0) {
+      LogMessage(3, "BSM read record failed errno = %d", error);
+      return error;
+    }
+    LogMessage(3, "BSM Audit event received");
+    ConvertAuditRecord(record, *this);
+  }
+}
+
+}  // namespace tarvod

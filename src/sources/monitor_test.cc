@@ -1,0 +1,177 @@
+#include "sources/monitor.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "platform/diagnostic_log.h"
+#include "platform/event_loop.h"
+#include "sources/test_sink.h"
+
+namespace tarvod {
+namespace {
+
+using testing::EventCollector;
+
+struct FilterTextCase {
+  std::optional<std::string> text;
+  std::optional<IdSet> expected;
+};
+
+TEST(ParseFilterList, ReadsEachPieceAsALeadingInteger) {
+  const std::vector<FilterTextCase> cases = {
+      {std::nullopt, std::nullopt},
+      {"", std::nullopt},
+      {"501", IdSet{501}},
+      {"0,501", IdSet{0, 501}},
+      {" 501", IdSet{501}},
+      {"501abc", IdSet{501}},
+      {"abc", IdSet{0}},
+      {"501,", IdSet{0, 501}},
+      {",", IdSet{0}},
+      {"-1", IdSet{-1}},
+      {"20,20,+20", IdSet{20}},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.text.value_or("(absent)"));
+    EXPECT_EQ(ParseFilterList(c.text), c.expected);
+  }
+}
+
+struct FilterCase {
+  const char* uids;  // nullptr: no list
+  const char* gids;
+  uint32_t uid;
+  uint32_t gid;
+  bool allowed;
+};
+
+TEST(FilterBySourceUID, AdmitsASenderWhoseUserOrGroupIsListed) {
+  const std::vector<FilterCase> cases = {
+      {nullptr, nullptr, 502, 20, true},
+      {"0,501", nullptr, 0, 80, true},
+      {"0,501", nullptr, 501, 0, true},
+      {"0,501", nullptr, 502, 20, false},
+      {nullptr, "20", 502, 20, true},
+      {nullptr, "20", 502, 21, false},
+      {"501", "80", 501, 20, true},
+      {"501", "80", 0, 80, true},
+      {"501", "80", 0, 0, false},
+      {"-1", nullptr, 4294967295u, 0, false},  // unsigned IDs never match a negative entry
+      {"-1", "20", 7, 20, true},
+      {",", nullptr, 0, 5, true},  // a lone comma lists root
+      {",", nullptr, 1, 5, false},
+      {"", nullptr, 1, 5, true},  // an empty text is no list at all
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(::testing::Message() << (c.uids ? c.uids : "-") << " / " << (c.gids ? c.gids : "-")
+                                      << " for " << c.uid << ":" << c.gid);
+    Monitor monitor(std::make_shared<Rulebase>(), std::make_shared<VariableStore>(), {});
+    auto parse = [](const char* text) {
+      return ParseFilterList(text ? std::optional<std::string_view>(text) : std::nullopt);
+    };
+    monitor.setEventFilterUID(parse(c.uids), parse(c.gids));
+    EXPECT_EQ(monitor.filterBySourceUID(c.uid, c.gid), c.allowed);
+  }
+}
+
+class LoggedTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/tarvod-monitor-XXXXXX";
+    ASSERT_NE(mkdtemp(pattern), nullptr);
+    mDirectory = pattern;
+    const int fd = open((mDirectory + "/error.log").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0600);
+    ASSERT_GE(fd, 0);
+    AttachErrorLog(fd);
+    SetDebugLevel(3);
+  }
+  void TearDown() override {
+    CloseLogs();
+    std::filesystem::remove_all(mDirectory);
+  }
+  std::string log() {
+    std::ifstream in(mDirectory + "/error.log");
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str();
+  }
+  std::string mDirectory;
+};
+
+TEST_F(LoggedTest, ARejectedSenderIsNamedInTheLog) {
+  Monitor monitor(std::make_shared<Rulebase>(), std::make_shared<VariableStore>(), {});
+  monitor.setEventFilterUID(IdSet{0, 501}, std::nullopt);
+  EXPECT_FALSE(monitor.filterBySourceUID(502, 20));
+  EXPECT_NE(log().find("Blocked event because user with ID 502 is not in the allowed UID list\n"),
+            std::string::npos);
+}
+
+TEST_F(LoggedTest, ProcessEventLogsTheEventAndDispatchesItWithTheCurrentRulebase) {
+  auto first = std::make_shared<Rulebase>();
+  auto second = std::make_shared<Rulebase>();
+  std::vector<Rulebase*> seen;
+  MonitorHooks hooks;
+  hooks.dispatch = [&](const RulebasePtr& rulebase, const plist::Dictionary&,
+                       const VariableStorePtr&) { seen.push_back(rulebase.get()); };
+  auto variables = std::make_shared<VariableStore>();
+  Monitor monitor(first, variables, hooks);
+  EXPECT_EQ(monitor.getVariables(), variables);
+  monitor.processEvent({{"eventType", "x.y"}});
+  monitor.setRulebase(second);
+  monitor.processEvent({{"eventType", "x.y"}});
+  EXPECT_EQ(seen, (std::vector<Rulebase*>{first.get(), second.get()}));
+  EXPECT_NE(log().find("Event received: {\n    eventType = x.y;\n} \n"), std::string::npos)
+      << log();
+}
+
+TEST_F(LoggedTest, BeginListeningReportsTheMissingAuditPipeAndListensAnyway) {
+  EventCollector collector;
+  Monitor monitor(std::make_shared<Rulebase>(), std::make_shared<VariableStore>(),
+                  collector.hooks());
+  monitor.setEventSocketPath(mDirectory + "/evtq");
+  monitor.beginListening();
+  const std::string text = log();
+  EXPECT_NE(text.find("Starting the New XPC event listener\n"), std::string::npos);
+  EXPECT_NE(text.find("Opening the BSM Auditpipe\n"), std::string::npos);
+  EXPECT_NE(text.find("Failed to open the Auditpipe error = 2\n"), std::string::npos);
+  EXPECT_EQ(text.find("XPC event listener failed to start up"), std::string::npos);
+  testing::Client client(mDirectory + "/evtq");
+  ASSERT_TRUE(client.send(testing::EventXml("works")));
+  EXPECT_TRUE(collector.waitFor(1));
+}
+
+TEST_F(LoggedTest, AListenerThatCannotStartIsReportedAndNothingElseStops) {
+  std::ofstream(mDirectory + "/taken") << "a file";
+  Monitor monitor(std::make_shared<Rulebase>(), std::make_shared<VariableStore>(), {});
+  monitor.setEventSocketPath(mDirectory + "/taken");
+  monitor.beginListening();
+  monitor.suspend();
+  monitor.resume();
+  monitor.stopListening();
+  const std::string text = log();
+  EXPECT_NE(text.find("XPC event listener failed to start up\n"), std::string::npos);
+  EXPECT_NE(text.find("Opening the BSM Auditpipe\n"), std::string::npos);
+  EXPECT_TRUE(std::filesystem::is_regular_file(mDirectory + "/taken"));
+}
+
+TEST(Monitor, StopListeningRunsEveryJobAlreadyOnTheInputQueue) {
+  EventCollector collector;
+  Monitor monitor(std::make_shared<Rulebase>(), std::make_shared<VariableStore>(),
+                  collector.hooks());
+  monitor.setEventSocketPath("/tmp/tarvod-monitor-drain-" + std::to_string(getpid()));
+  monitor.beginListening();
+  for (int i = 0; i < 100; ++i) {
+    monitor.inputQueue()->post([&monitor] { monitor.processEvent({{"eventType", "queued"}}); });
+  }
+  monitor.stopListening();
+  EXPECT_EQ(collector.size(), 100u);
+}
+
+}  // namespace
+}  // namespace tarvod
