@@ -1,0 +1,138 @@
+#include "context/builtins.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+
+#include "context/context.h"
+#include "platform/diagnostic_log.h"
+
+namespace tarvod {
+namespace {
+
+using plist::Value;
+
+class BuiltinsTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/tarvod-builtins-XXXXXX";
+    dir_ = mkdtemp(pattern);
+    log_ = dir_ + "/error.log";
+    const int fd = SafeOpen(log_.c_str(), 0600, O_WRONLY | O_APPEND);
+    ASSERT_GE(fd, 0);
+    AttachErrorLog(fd);
+    SetDebugLevel(0);
+    meminfo_ = dir_ + "/meminfo";
+    std::ofstream(meminfo_)
+        << "MemFree: 8 kB\nActive: 16 kB\nInactive: 32 kB\nUnevictable: 64 kB\n";
+    SetMeminfoPathForTesting(meminfo_);
+  }
+  void TearDown() override {
+    SetMeminfoPathForTesting("");
+    CloseLogs();
+    std::system(("rm -rf " + dir_).c_str());
+  }
+  std::string Log() const {
+    std::ifstream in(log_);
+    std::ostringstream s;
+    s << in.rdbuf();
+    return s.str();
+  }
+  Context MakeContext() {
+    return Context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>());
+  }
+  std::string dir_, log_, meminfo_;
+};
+
+double Number(const std::optional<Value>& v) { return v ? v->numberValue() : -1; }
+
+TEST_F(BuiltinsTest, IntervalsAreHoursMinutesAndFractionalSecondsWithoutRangeLimits) {
+  EXPECT_DOUBLE_EQ(ParseInterval("01:30:00", true), 5400);
+  EXPECT_DOUBLE_EQ(ParseInterval("00:00:01.5", false), -1.5);
+  EXPECT_DOUBLE_EQ(ParseInterval("0:90:75", true), 5475);
+  EXPECT_DOUBLE_EQ(ParseInterval("-1:00:00", true), -3600);
+  EXPECT_EQ(Log(), "");
+}
+
+TEST_F(BuiltinsTest, MalformedIntervalsLogAndCountAsZero) {
+  EXPECT_EQ(ParseInterval("90", true), 0);
+  EXPECT_EQ(ParseInterval("1:2:3:4", true), 0);
+  EXPECT_EQ(Log(),
+            "ParseInterval: interval string is malformed, expecting  HH:MM:SS.SSS got 90\n"
+            "ParseInterval: interval string is malformed, expecting  HH:MM:SS.SSS got 1:2:3:4\n");
+}
+
+TEST_F(BuiltinsTest, NowAndItsOffsetsAreSecondsSince2001) {
+  Context context = MakeContext();
+  const auto now = context.valueForBuiltinVariableKey("now");
+  ASSERT_TRUE(now && now->isString());
+  // "%f": fixed point with six decimals.
+  EXPECT_EQ(now->string().size() - now->string().find('.'), 7u);
+  EXPECT_NEAR(Number(now), SecondsSince2001Now(), 60);
+  EXPECT_NEAR(Number(context.valueForBuiltinVariableKey("now+01:30:00")) - Number(now), 5400, 60);
+  EXPECT_NEAR(Number(context.valueForBuiltinVariableKey("nowX00:10:00")) - Number(now), -600, 60);
+  EXPECT_NEAR(Number(context.valueForBuiltinVariableKey("nowhere")), Number(now), 60);
+  EXPECT_NE(Log().find("got ere\n"), std::string::npos);
+}
+
+TEST_F(BuiltinsTest, MemoryKeysAreMatchedByTheirEnding) {
+  StatContext stats;
+  stats.counters[0] = 1;  // free
+  stats.counters[1] = 2;  // active
+  stats.counters[2] = 4;  // inactive
+  stats.counters[3] = 8;  // wired
+  stats.count = 4;
+  const uint64_t page = HostPageSize();
+  const std::pair<const char*, std::string> cases[] = {
+      {"system:memory:free", std::to_string(1 * page)},
+      {"system:memory:active", std::to_string(2 * page)},
+      {"system:memory:inactive", std::to_string(4 * page)},
+      {"system:memory:wired", std::to_string(8 * page)},
+      {"system:memory:used", std::to_string(14 * page)},
+      {"system:memory:unused", std::to_string(14 * page)},
+      {"system:memory:installed", "not-implemented"},
+      {"system:memory:pageins", "not-implemented"},
+      {"system:memory:pageouts", "not-implemented"},
+      {"system:memory:other", "not-implemented"},
+      {"system:cpu:load", "not-implemented"},
+  };
+  for (const auto& [key, expected] : cases)
+    EXPECT_EQ(SystemStatForKey(key, stats), expected) << key;
+}
+
+TEST_F(BuiltinsTest, SystemKeysReadTheSnapshotOrRuleErrorWithoutOne) {
+  Context context = MakeContext();
+  EXPECT_EQ(context.valueForBuiltinVariableKey("system:memory:free"),
+            Value(std::to_string(8 * 1024 / HostPageSize() * HostPageSize())));
+
+  SetMeminfoPathForTesting(dir_ + "/missing");
+  Context failed = MakeContext();
+  EXPECT_EQ(failed.valueForBuiltinVariableKey("system:memory:free"), Value("rule-error"));
+  EXPECT_EQ(failed.valueForBuiltinVariableKey("system:cpu:load"), Value("rule-error"));
+  EXPECT_EQ(failed.valueForBuiltinVariableKey("hostName"), Value(HostName()));
+}
+
+TEST_F(BuiltinsTest, HostAndEventKeys) {
+  Context context = MakeContext();
+  EXPECT_EQ(context.valueForBuiltinVariableKey("hostIP"),
+            context.valueForBuiltinVariableKey("hostIPv6"));
+  EXPECT_EQ(context.valueForBuiltinVariableKey("eventDictionary"), std::nullopt);
+  EXPECT_EQ(context.valueForBuiltinVariableKey("event"), std::nullopt);
+  EXPECT_EQ(context.valueForBuiltinVariableKey("Now"), std::nullopt);
+
+  const plist::Dictionary event{{"eventType", "a.b"},
+                                {"eventDetails", plist::Dictionary{{"x", "1"}}}};
+  Context withEvent(std::make_shared<VariableStore>(), std::make_shared<Rulebase>(), event);
+  const auto dictionary = withEvent.valueForBuiltinVariableKey("eventDictionary");
+  ASSERT_TRUE(dictionary && dictionary->isDictionary());
+  EXPECT_EQ(*dictionary->dictionary().findString("x"), "1");
+  EXPECT_EQ(withEvent.valueForBuiltinVariableKey("event"),
+            Value(plist::Describe(*withEvent.event())));
+}
+
+}  // namespace
+}  // namespace tarvod
