@@ -7,6 +7,7 @@
 #include <cstdio>
 #include <filesystem>
 #include <memory>
+#include <optional>
 #include <string>
 
 #include "context/types.h"
@@ -18,6 +19,8 @@
 #include "platform/diagnostic_log.h"
 #include "platform/host_stats.h"
 #include "plist/value.h"
+#include "sources/event_listener.h"
+#include "sources/monitor.h"
 
 namespace tarvod {
 namespace {
@@ -166,11 +169,21 @@ int DaemonMain(int argc, char** argv) {
   }
 
   // Step 19: Monitor.
+  auto monitor = std::make_unique<Monitor>(rulebase, variables);
+  monitor->setEventSocketPath(
+      ConfigurationString(configuration, "eventSocketPath", kDefaultEventSocketPath));
   // Step 20: sender filter.
+  const auto filterText = [&](const char* key) -> std::optional<std::string> {
+    const plist::Value* value = configuration.find(key);
+    return value ? std::optional<std::string>(value->textForm()) : std::nullopt;
+  };
+  monitor->setEventFilterUID(ParseFilterList(filterText("filterByUID")),
+                             ParseFilterList(filterText("filterByGID")));
   // Step 21: raise startup.load.
   // Step 22: periodic events.
   // Step 23: notification observers.
   // Step 24: begin listening.
+  monitor->beginListening();
   LogMessage(1, "Registered %d events", 0);
   // Step 26: enable the companion log job.
 
@@ -195,6 +208,7 @@ int DaemonMain(int argc, char** argv) {
 
   // Shutdown event.
   // Stop the sources.
+  monitor->stopListening();
   LogMessage(0, "Velkin Shutdown at %s", NowText().c_str());
   CloseLogs();
   sd_event_source_unref(wakeSource);
