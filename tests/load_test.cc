@@ -1,0 +1,104 @@
+// Load without loss: many concurrent senders against one counting rule. Every event must be
+// counted, and the daemon's memory must stay bounded while the rule engine lags behind the
+// senders (the event socket then stops reading and senders wait in the kernel).
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <thread>
+
+#include "harness.h"
+#include "platform/seqpacket.h"
+
+namespace tarvod::testing {
+namespace {
+
+constexpr int kSenders = 8;
+constexpr int kEventsPerSender = 25'000;
+// The daemon's peak resident memory must stay below this. An unbounded queue of 200,000
+// parsed events and their rule jobs would take several hundred MiB; the bounded pipeline
+// needs a small fraction of it.
+constexpr long kResidentBoundKb = 96 * 1024;
+
+std::string String(std::string_view s) { return "<string>" + std::string(s) + "</string>"; }
+
+size_t CountLines(const std::string& path) {
+  if (!FileExists(path)) return 0;
+  const std::string text = ReadFile(path);
+  return static_cast<size_t>(std::count(text.begin(), text.end(), '\n'));
+}
+
+TEST(Load, EveryEventOfEightConcurrentSendersIsCountedInBoundedMemory) {
+  TempDir dir;
+  const std::string socketPath = dir.file("run/evtq");
+  const std::string counted = dir.file("counted.log");
+  const std::string config = dir.write(
+      "tarvod.plist", ConfigPlist({{"errorLogPath", String(dir.file("error.log"))},
+                                   {"structuredLogPath", String(dir.file("records.jsonl"))},
+                                   {"stateDirectory", String(dir.file("state"))},
+                                   {"eventSocketPath", String(socketPath)}}));
+  const std::string rule = "<dict><key>name</key>" + String("count") +
+                           "<key>eventTypes</key><array>" + String("load") +
+                           "</array><key>actions</key><array><dict><key>type</key>" +
+                           String("log") + "<key>message</key>" + String("${event:n}") +
+                           "<key>logPath</key>" + String(counted) + "</dict></array></dict>";
+  const std::string rules = dir.write("rules.plist", PlistDocument("<array>" + rule + "</array>"));
+  Daemon daemon({"-c", config, "-r", rules, "-n"}, dir);
+  ASSERT_TRUE(daemon.waitForLine(dir.file("error.log"), "Registered"));
+
+  std::atomic<int> failures{0};
+  std::atomic<bool> sending{true};
+  std::atomic<long> peakKb{0};
+  std::thread sampler([&] {
+    while (sending) {
+      peakKb = std::max(peakKb.load(), ResidentKb(daemon.pid()));
+      std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+  });
+  std::vector<std::thread> senders;
+  for (int s = 0; s < kSenders; ++s) {
+    senders.emplace_back([&, s] {
+      const SocketResult connection = ConnectSeqpacket(socketPath);
+      if (connection.fd < 0) {
+        ++failures;
+        return;
+      }
+      std::string error;
+      for (int i = 0; i < kEventsPerSender; ++i) {
+        const std::string message = PlistDocument(
+            "<dict><key>eventType</key><string>load</string><key>eventDetails</key>"
+            "<dict><key>n</key><string>" +
+            std::to_string(s) + "-" + std::to_string(i) + "</string></dict></dict>");
+        if (!SendPacket(connection.fd, message, &error)) {
+          ++failures;
+          break;
+        }
+      }
+      close(connection.fd);
+    });
+  }
+  for (auto& t : senders) t.join();
+  ASSERT_EQ(failures, 0);
+
+  const size_t expected = static_cast<size_t>(kSenders) * kEventsPerSender;
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::minutes(4);
+  while (CountLines(counted) < expected && std::chrono::steady_clock::now() < deadline) {
+    peakKb = std::max(peakKb.load(), ResidentKb(daemon.pid()));
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  }
+  sending = false;
+  sampler.join();
+  const long hwm = PeakResidentKb(daemon.pid());
+  EXPECT_EQ(CountLines(counted), expected);
+  std::printf("daemon peak resident memory: %ld kB (sampled %ld kB), bound %ld kB\n", hwm,
+              peakKb.load(), kResidentBoundKb);
+  EXPECT_LT(std::max(hwm, peakKb.load()), kResidentBoundKb);
+  EXPECT_EQ(daemon.stop(), 0);
+}
+
+}  // namespace
+}  // namespace tarvod::testing

@@ -1,0 +1,270 @@
+// The event sources against the real daemon: senders under other identities and the sender
+// filter, the event socket's message handling, the missing audit pipe, and tarvodctl.
+#include <gmock/gmock.h>
+#include <grp.h>
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <filesystem>
+
+#include "harness.h"
+#include "platform/seqpacket.h"
+
+namespace tarvod::testing {
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+std::string String(std::string_view s) { return "<string>" + std::string(s) + "</string>"; }
+
+// A message for the event socket: { eventType; eventDetails = { tag }; } plus extra XML keys.
+std::string EventMessage(std::string_view type, std::string_view tag,
+                         std::string_view extraXml = {}) {
+  return PlistDocument("<dict><key>eventType</key>" + String(type) +
+                       "<key>eventDetails</key><dict><key>tag</key>" + String(tag) + "</dict>" +
+                       std::string(extraXml) + "</dict>");
+}
+
+// Sends one packet as the given identity, from a child process that takes the identity before
+// it connects (the daemon reads the peer's IDs at connection time). True when it was sent.
+bool SendAs(uid_t uid, gid_t gid, const std::string& socketPath, const std::string& message) {
+  const pid_t child = fork();
+  if (child == 0) {
+    if (setgroups(0, nullptr) != 0 || setgid(gid) != 0 || setuid(uid) != 0) _exit(3);
+    const SocketResult connection = ConnectSeqpacket(socketPath);
+    if (connection.fd < 0) _exit(4);
+    std::string error;
+    _exit(SendPacket(connection.fd, message, &error) ? 0 : 5);
+  }
+  int status = 0;
+  waitpid(child, &status, 0);
+  return WIFEXITED(status) && WEXITSTATUS(status) == 0;
+}
+
+// The daemon with one rule on "t" that appends "tag uid gid" for every event to events.log.
+class SourcesTest : public ::testing::Test {
+ protected:
+  SourcesTest() {
+    // Senders under other identities must reach the socket, so it lives outside the
+    // private test directory.
+    static std::atomic<int> counter{0};
+    mSocketDirectory =
+        "/tmp/tarvod-sources-" + std::to_string(getpid()) + "-" + std::to_string(counter++);
+    mSocketPath = mSocketDirectory + "/evtq";
+  }
+  ~SourcesTest() override { std::filesystem::remove_all(mSocketDirectory); }
+
+  void startDaemon(std::vector<std::pair<std::string, std::string>> extraConfig = {}) {
+    std::vector<std::pair<std::string, std::string>> config = {
+        {"errorLogPath", String(dir.file("error.log"))},
+        {"structuredLogPath", String(dir.file("records.jsonl"))},
+        {"stateDirectory", String(dir.file("state"))},
+        {"eventSocketPath", String(mSocketPath)},
+    };
+    config.insert(config.end(), extraConfig.begin(), extraConfig.end());
+    mConfigPath = dir.write("tarvod.plist", ConfigPlist(config));
+    const std::string rule =
+        "<dict><key>name</key>" + String("record") + "<key>eventTypes</key><array>" + String("t") +
+        "</array><key>actions</key><array><dict><key>type</key>" + String("log") +
+        "<key>message</key>" + String("${event:tag} ${event:senderUID} ${event:senderGID}") +
+        "<key>logPath</key>" + String(eventsLog()) + "</dict></array></dict>";
+    const std::string rules =
+        dir.write("rules.plist", PlistDocument("<array>" + rule + "</array>"));
+    mDaemon = std::make_unique<Daemon>(
+        std::vector<std::string>{"-c", mConfigPath, "-r", rules, "-v", "4", "-n"}, dir);
+    ASSERT_TRUE(mDaemon->waitForLine(errorLog(), "Opening the BSM Auditpipe")) << log();
+  }
+  std::string errorLog() const { return dir.file("error.log"); }
+  std::string eventsLog() const { return dir.file("events.log"); }
+  std::string log() const { return ReadFile(errorLog()); }
+  bool waitForEvent(std::string_view line) { return mDaemon->waitForLine(eventsLog(), line); }
+  bool waitForLog(std::string_view line) { return mDaemon->waitForLine(errorLog(), line); }
+
+  TempDir dir;
+  std::string mSocketDirectory;
+  std::string mSocketPath;
+  std::string mConfigPath;
+  std::unique_ptr<Daemon> mDaemon;
+};
+
+struct Sender {
+  uid_t uid;
+  gid_t gid;
+  bool admitted;
+};
+struct FilterCase {
+  const char* name;
+  const char* uids;  // nullptr: key absent
+  const char* gids;
+  std::vector<Sender> senders;
+};
+
+TEST_F(SourcesTest, TheSenderFilterDecidesWhichSendersReachARule) {
+  const std::vector<FilterCase> cases = {
+      {"a UID list",
+       "1001,1002",
+       nullptr,
+       {{1001, 3000, true}, {1002, 3000, true}, {1003, 3000, false}}},
+      {"a GID list", nullptr, "3001", {{1001, 3001, true}, {1001, 3002, false}, {0, 0, false}}},
+      {"both lists", "1001", "3005", {{1001, 3000, true}, {1002, 3005, true}, {1002, 3000, false}}},
+      {"-1", "-1", nullptr, {{1001, 3000, false}, {0, 0, false}}},
+      {"a lone comma", ",", nullptr, {{0, 0, true}, {1001, 3000, false}}},
+      {"an empty string", "", nullptr, {{1001, 3000, true}, {0, 0, true}}},
+  };
+  for (const FilterCase& c : cases) {
+    SCOPED_TRACE(c.name);
+    std::vector<std::pair<std::string, std::string>> filters;
+    if (c.uids) filters.push_back({"filterByUID", String(c.uids)});
+    if (c.gids) filters.push_back({"filterByGID", String(c.gids)});
+    std::filesystem::remove(eventsLog());
+    std::filesystem::remove(errorLog());
+    startDaemon(filters);
+
+    for (size_t i = 0; i < c.senders.size(); ++i) {
+      const Sender& s = c.senders[i];
+      ASSERT_TRUE(
+          SendAs(s.uid, s.gid, mSocketPath, EventMessage("t", "sender" + std::to_string(i))));
+    }
+    // Every sender has been admitted or refused before this point: refusals are logged, and
+    // admitted senders' lines are written.
+    for (size_t i = 0; i < c.senders.size(); ++i) {
+      const Sender& s = c.senders[i];
+      const std::string ids = std::to_string(s.uid) + " " + std::to_string(s.gid);
+      if (s.admitted) {
+        EXPECT_TRUE(waitForEvent("sender" + std::to_string(i) + " " + ids + "\n")) << log();
+      } else {
+        EXPECT_TRUE(waitForLog("XPC Event rejected from " + std::to_string(s.uid) + ":" +
+                               std::to_string(s.gid) + " (uid:gid)"))
+            << log();
+        EXPECT_THAT(log(), HasSubstr("Blocked event because user with ID " + std::to_string(s.uid) +
+                                     " is not in the allowed UID list"));
+      }
+    }
+    EXPECT_EQ(mDaemon->stop(), 0);
+    const std::string lines = FileExists(eventsLog()) ? ReadFile(eventsLog()) : "";
+    for (size_t i = 0; i < c.senders.size(); ++i) {
+      if (!c.senders[i].admitted) {
+        EXPECT_THAT(lines, Not(HasSubstr("sender" + std::to_string(i) + " ")));
+      }
+    }
+    mDaemon.reset();
+  }
+}
+
+TEST_F(SourcesTest, ASendersOwnSenderUIDIsKept) {
+  startDaemon();
+  ASSERT_TRUE(SendAs(1001, 3000, mSocketPath,
+                     EventMessage("t", "own", "<key>senderUID</key>" + String("chosen"))));
+  EXPECT_TRUE(waitForEvent("own chosen 3000\n")) << log();
+}
+
+TEST_F(SourcesTest, MessagesOnOneConnectionAreHandledInOrderAndSurviveMalformedOnes) {
+  startDaemon();
+  const SocketResult connection = ConnectSeqpacket(mSocketPath);
+  ASSERT_GE(connection.fd, 0) << connection.error;
+  std::string error;
+  for (const char* tag : {"one", "two", "three"}) {
+    ASSERT_TRUE(SendPacket(connection.fd, EventMessage("t", tag), &error)) << error;
+  }
+  ASSERT_TRUE(SendPacket(connection.fd, "not a property list", &error));
+  ASSERT_TRUE(SendPacket(connection.fd, EventMessage("t", "after"), &error));
+  // A dictionary without eventType is passed on and then ignored by the rule engine.
+  ASSERT_TRUE(SendPacket(connection.fd,
+                         PlistDocument("<dict><key>x</key><string>y</string></dict>"), &error));
+  ASSERT_TRUE(SendPacket(connection.fd, EventMessage("t", "last"), &error));
+  ASSERT_TRUE(waitForEvent("last 0 0\n")) << log();
+  EXPECT_EQ(ReadFile(eventsLog()), "one 0 0\ntwo 0 0\nthree 0 0\nafter 0 0\nlast 0 0\n");
+  EXPECT_THAT(log(), HasSubstr("_CFXPCCreateCFObjectFromXPCObject returned NULL\n"
+                               "XPC Malformed event received from 0:0 (uid:gid)\n"));
+  close(connection.fd);
+}
+
+TEST_F(SourcesTest, ANonDictionaryMessageClosesItsConnection) {
+  startDaemon();
+  const SocketResult connection = ConnectSeqpacket(mSocketPath);
+  ASSERT_GE(connection.fd, 0);
+  std::string error;
+  ASSERT_TRUE(
+      SendPacket(connection.fd, PlistDocument("<array><string>a</string></array>"), &error));
+  char byte;
+  EXPECT_EQ(recv(connection.fd, &byte, 1, 0), 0) << "the daemon closed the connection";
+  EXPECT_TRUE(waitForLog("unexpected peer event: ")) << log();
+  close(connection.fd);
+  ASSERT_TRUE(SendAs(0, 0, mSocketPath, EventMessage("t", "next")));
+  EXPECT_TRUE(waitForEvent("next 0 0\n"));
+}
+
+TEST_F(SourcesTest, TheMissingAuditPipeIsReportedAndEventsStillArrive) {
+  startDaemon();
+  ASSERT_TRUE(waitForLog("Failed to open the Auditpipe error = 2\n")) << log();
+  EXPECT_THAT(log(), HasSubstr("open of /dev/auditpipe failed errno = 2\n"));
+  EXPECT_THAT(mDaemon->stderrText(), HasSubstr("failed to open the auditpipe: "));
+  ASSERT_TRUE(SendAs(0, 0, mSocketPath, EventMessage("t", "socket")));
+  EXPECT_TRUE(waitForEvent("socket 0 0\n"));
+}
+
+TEST_F(SourcesTest, APathHoldingAFileIsLeftAloneAndTheDaemonRunsOn) {
+  std::filesystem::create_directories(mSocketDirectory);
+  WriteFile(mSocketPath, "keep me");
+  startDaemon();
+  EXPECT_TRUE(waitForLog("XPC event listener failed to start up\n")) << log();
+  EXPECT_EQ(ReadFile(mSocketPath), "keep me");
+  EXPECT_TRUE(mDaemon->running());
+  EXPECT_EQ(mDaemon->stop(), 0);
+}
+
+TEST_F(SourcesTest, AStaleSocketFromAnEarlierRunIsReplaced) {
+  startDaemon();
+  ASSERT_EQ(mDaemon->stop(SIGKILL), 128 + SIGKILL);  // leaves the socket file behind
+  struct stat st;
+  ASSERT_EQ(lstat(mSocketPath.c_str(), &st), 0);
+  startDaemon();
+  ASSERT_TRUE(SendAs(0, 0, mSocketPath, EventMessage("t", "again")));
+  EXPECT_TRUE(waitForEvent("again 0 0\n")) << log();
+  EXPECT_EQ(mDaemon->stop(), 0);
+  EXPECT_FALSE(FileExists(mSocketPath)) << "the socket file is removed at stop";
+}
+
+TEST_F(SourcesTest, TarvodctlSendsEventsFromArgumentsAndFromAPropertyListFile) {
+  startDaemon();
+  RunResult sent = RunProgram({TarvodctlBinary(), "-c", mConfigPath, "send", "t", "tag=ctl"});
+  EXPECT_EQ(sent.status, 0) << sent.err;
+  EXPECT_TRUE(waitForEvent("ctl 0 0\n")) << log();
+
+  const std::string file = dir.write("event.plist", EventMessage("t", "fromfile"));
+  sent = RunProgram({TarvodctlBinary(), "send", "--socket", mSocketPath, "--plist", file});
+  EXPECT_EQ(sent.status, 0) << sent.err;
+  EXPECT_TRUE(waitForEvent("fromfile 0 0\n")) << log();
+}
+
+TEST_F(SourcesTest, TarvodctlExplainsWhyItCouldNotSend) {
+  const RunResult notListening =
+      RunProgram({TarvodctlBinary(), "send", "--socket", mSocketPath, "t", "a=b"});
+  EXPECT_NE(notListening.status, 0);
+  EXPECT_THAT(notListening.err, HasSubstr("tarvod is not listening"));
+
+  const std::string array = dir.write("array.plist", PlistDocument("<array/>"));
+  const RunResult notDictionary =
+      RunProgram({TarvodctlBinary(), "send", "--socket", mSocketPath, "--plist", array});
+  EXPECT_NE(notDictionary.status, 0);
+  EXPECT_THAT(notDictionary.err, HasSubstr("is not a dictionary"));
+
+  const std::string big =
+      dir.write("big.plist", EventMessage("t", std::string(1024 * 1024 + 1, 'b')));
+  const RunResult tooLarge =
+      RunProgram({TarvodctlBinary(), "send", "--socket", mSocketPath, "--plist", big});
+  EXPECT_NE(tooLarge.status, 0);
+  EXPECT_THAT(tooLarge.err, HasSubstr("too large"));
+
+  const RunResult usage = RunProgram({TarvodctlBinary(), "send"});
+  EXPECT_EQ(usage.status, 2);
+  EXPECT_THAT(usage.err, HasSubstr("usage: tarvodctl"));
+}
+
+}  // namespace
+}  // namespace tarvod::testing
