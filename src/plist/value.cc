@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <ctime>
 #include <limits>
+#include <unordered_map>
 
 namespace plist {
 
@@ -190,6 +191,25 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) {
   for (const auto& [key, value] : entries) set(key, value);
 }
 
+Dictionary Dictionary::FromEntries(std::vector<Entry> entries) {
+  Dictionary result;
+  result.entries_.reserve(entries.size());
+  // Positions of the keys already taken. The views point into result.entries_, whose storage
+  // was reserved above and so never moves.
+  std::unordered_map<std::string_view, size_t> positions;
+  positions.reserve(entries.size());
+  for (auto& entry : entries) {
+    auto it = positions.find(entry.first);
+    if (it != positions.end()) {
+      result.entries_[it->second].second = std::move(entry.second);
+      continue;
+    }
+    result.entries_.emplace_back(std::move(entry.first), std::move(entry.second));
+    positions.emplace(result.entries_.back().first, result.entries_.size() - 1);
+  }
+  return result;
+}
+
 const Value* Dictionary::find(std::string_view key) const {
   for (const auto& entry : entries_) {
     if (entry.first == key) return &entry.second;
@@ -268,6 +288,103 @@ std::string FormatDate(Date date, bool localTime) {
 
 namespace {
 
+// Days from 1970-01-01 to a date of the proleptic Gregorian calendar.
+int64_t DaysFromCivil(int64_t year, int month, int day) {
+  year -= month <= 2 ? 1 : 0;
+  const int64_t era = (year >= 0 ? year : year - 399) / 400;
+  const int64_t yearOfEra = year - era * 400;
+  const int64_t dayOfYear = (153 * (month + (month > 2 ? -3 : 9)) + 2) / 5 + day - 1;
+  const int64_t dayOfEra = yearOfEra * 365 + yearOfEra / 4 - yearOfEra / 100 + dayOfYear;
+  return era * 146097 + dayOfEra - 719468;
+}
+
+bool IsLeapYear(int year) { return year % 4 == 0 && (year % 100 != 0 || year % 400 == 0); }
+
+int DaysInMonth(int year, int month) {
+  static const int kDays[] = {31, 28, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
+  return month == 2 && IsLeapYear(year) ? 29 : kDays[month - 1];
+}
+
+// Reads exactly `count` decimal digits at `text[at]`; -1 when they are not all digits.
+int FixedDigits(std::string_view text, size_t at, size_t count) {
+  int result = 0;
+  for (size_t i = at; i < at + count; ++i) {
+    if (i >= text.size() || !IsDigit(text[i])) return -1;
+    result = result * 10 + (text[i] - '0');
+  }
+  return result;
+}
+
+}  // namespace
+
+std::optional<Date> ParseDate(std::string_view text) {
+  // "YYYY-MM-DD HH:MM:SS +HHMM" or "YYYY-MM-DDTHH:MM:SSZ"
+  const bool formatted = text.size() == 25 && text[10] == ' ' && text[19] == ' ' &&
+                         (text[20] == '+' || text[20] == '-');
+  const bool xml = text.size() == 20 && text[10] == 'T' && text[19] == 'Z';
+  if (!formatted && !xml) return std::nullopt;
+  if (text[4] != '-' || text[7] != '-' || text[13] != ':' || text[16] != ':') return std::nullopt;
+  const int year = FixedDigits(text, 0, 4);
+  const int month = FixedDigits(text, 5, 2);
+  const int day = FixedDigits(text, 8, 2);
+  const int hour = FixedDigits(text, 11, 2);
+  const int minute = FixedDigits(text, 14, 2);
+  const int second = FixedDigits(text, 17, 2);
+  if (year < 1 || month < 1 || month > 12 || day < 1 || day > DaysInMonth(year, month) ||
+      hour < 0 || hour > 23 || minute < 0 || minute > 59 || second < 0 || second > 59) {
+    return std::nullopt;
+  }
+  int64_t offset = 0;
+  if (formatted) {
+    const int offsetHours = FixedDigits(text, 21, 2);
+    const int offsetMinutes = FixedDigits(text, 23, 2);
+    if (offsetHours < 0 || offsetHours > 23 || offsetMinutes < 0 || offsetMinutes > 59) {
+      return std::nullopt;
+    }
+    offset = (offsetHours * 3600 + offsetMinutes * 60) * (text[20] == '-' ? -1 : 1);
+  }
+  const int64_t unixSeconds =
+      DaysFromCivil(year, month, day) * 86400 + hour * 3600 + minute * 60 + second - offset;
+  return Date{static_cast<double>(unixSeconds) - kUnixTimeOfReferenceDate};
+}
+
+bool IsValidUtf8(std::string_view text) {
+  const auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
+  const size_t size = text.size();
+  size_t i = 0;
+  while (i < size) {
+    const unsigned char lead = bytes[i];
+    if (lead < 0x80) {
+      ++i;
+      continue;
+    }
+    size_t length;
+    unsigned char low = 0x80, high = 0xBF;  // the range of the second byte
+    if (lead >= 0xC2 && lead <= 0xDF) {
+      length = 2;
+    } else if (lead >= 0xE0 && lead <= 0xEF) {
+      length = 3;
+      if (lead == 0xE0) low = 0xA0;   // overlong
+      if (lead == 0xED) high = 0x9F;  // surrogates
+    } else if (lead >= 0xF0 && lead <= 0xF4) {
+      length = 4;
+      if (lead == 0xF0) low = 0x90;   // overlong
+      if (lead == 0xF4) high = 0x8F;  // above U+10FFFF
+    } else {
+      return false;
+    }
+    if (size - i < length) return false;
+    if (bytes[i + 1] < low || bytes[i + 1] > high) return false;
+    for (size_t k = 2; k < length; ++k) {
+      if (bytes[i + k] < 0x80 || bytes[i + k] > 0xBF) return false;
+    }
+    i += length;
+  }
+  return true;
+}
+
+namespace {
+
 std::string FormatReal(double d) {
   if (std::isnan(d)) return "nan";
   if (std::isinf(d)) return d < 0 ? "-inf" : "inf";
@@ -297,6 +414,8 @@ bool IsWordChar(char c) { return IsWordStart(c) || IsDigit(c) || c == '.' || c =
 bool IsPlainWord(const std::string& s) {
   if (s.empty() || !IsWordStart(s[0])) return false;
   if (s == "true" || s == "false" || s == "nan" || s == "inf") return false;
+  // "//" and "/*" would start a comment where a value is expected.
+  if (s.starts_with("//")) return false;
   return std::all_of(s.begin(), s.end(), IsWordChar);
 }
 

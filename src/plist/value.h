@@ -6,6 +6,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -129,6 +130,10 @@ class Dictionary {
 
   Dictionary() = default;
   Dictionary(std::initializer_list<Entry> entries);
+  // Builds a dictionary from entries in their order; a key that repeats replaces the earlier
+  // value in place, as set does. Linear in the number of entries, so readers of untrusted
+  // input use it rather than repeated set calls.
+  static Dictionary FromEntries(std::vector<Entry> entries);
 
   size_t size() const { return entries_.size(); }
   bool empty() const { return entries_.empty(); }
@@ -167,6 +172,14 @@ std::string Describe(const Dictionary& dictionary);
 
 // Formats a date as "YYYY-MM-DD HH:MM:SS +HHMM" in the given zone (local time when true).
 std::string FormatDate(Date date, bool localTime);
+// Reads a date back from FormatDate's form ("YYYY-MM-DD HH:MM:SS +HHMM", any zone offset) or
+// from the XML property-list form ("YYYY-MM-DDTHH:MM:SSZ"); years 1 to 9999. nullopt when the
+// text is neither.
+std::optional<Date> ParseDate(std::string_view text);
+
+// Whether the bytes are well-formed UTF-8 (no overlong forms, surrogates or code points above
+// U+10FFFF). Every string a reader returns has passed this test.
+bool IsValidUtf8(std::string_view text);
 
 // The leading decimal number / integer of a text, as numberValue and integerValue read it.
 double LeadingNumber(std::string_view text);
