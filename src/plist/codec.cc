@@ -97,6 +97,16 @@ bool RealTextIsNumber(std::string_view text) {
   return i == text.size();
 }
 
+// libplist writes the year without leading zeros ("1-01-01T00:00:00Z" for year 1).
+std::optional<Date> ParseXmlDate(std::string_view text) {
+  text = TrimXmlBlanks(text);
+  const size_t yearDigits = text.find('-');
+  if (yearDigits == 0 || yearDigits > 4 || yearDigits == std::string_view::npos) {
+    return std::nullopt;
+  }
+  return ParseDate(std::string(4 - yearDigits, '0') + std::string(text));
+}
+
 bool Base64TextIsValid(std::string_view text) {
   for (char c : text) {
     const bool ok = (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') ||
@@ -179,7 +189,7 @@ bool XmlShapeIsSafe(std::string_view xml) {
       const std::string_view text = xml.substr(pos, textEnd - pos);
       const bool ok = name == "integer" ? IntegerTextFits(text)
                       : name == "real"  ? RealTextIsNumber(text)
-                      : name == "date"  ? ParseDate(TrimXmlBlanks(text)).has_value()
+                      : name == "date"  ? ParseXmlDate(text).has_value()
                                         : Base64TextIsValid(text);
       if (!ok) return false;
     }
@@ -318,6 +328,8 @@ class BinaryChecker {
         out.count = count;
         out.payload = pos;
         if (out.type == 0x6) return utf16IsPaired(pos, count);
+        // libplist cuts a string at its first NUL: refuse rather than shorten it silently.
+        if (out.type == 0x5) return std::memchr(mData + pos, 0, count) == nullptr;
         return true;
       }
       default:
@@ -325,10 +337,11 @@ class BinaryChecker {
     }
   }
 
+  // Surrogates come in pairs, and no NUL (see the ASCII case above).
   bool utf16IsPaired(uint64_t pos, uint64_t units) const {
     for (uint64_t i = 0; i < units; ++i) {
       const uint64_t u = ReadBigEndian(mData + pos + 2 * i, 2);
-      if (u >= 0xDC00 && u <= 0xDFFF) return false;
+      if (u == 0 || (u >= 0xDC00 && u <= 0xDFFF)) return false;
       if (u >= 0xD800 && u <= 0xDBFF) {
         if (i + 1 >= units) return false;
         const uint64_t next = ReadBigEndian(mData + pos + 2 * (i + 1), 2);
@@ -449,7 +462,7 @@ std::optional<Date> DateFromNodeText(plist_t node) {
   const size_t open = text.find("<date>");
   const size_t close = text.find("</date>");
   if (open == std::string::npos || close == std::string::npos || close < open) return std::nullopt;
-  return ParseDate(TrimXmlBlanks(std::string_view(text).substr(open + 6, close - open - 6)));
+  return ParseXmlDate(std::string_view(text).substr(open + 6, close - open - 6));
 }
 
 std::optional<std::string> StringOfNode(plist_t node) {

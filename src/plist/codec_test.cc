@@ -37,11 +37,14 @@ Value EveryKind() {
                                 Value::Real(std::numeric_limits<double>::infinity()),
                                 Value::Real(-std::numeric_limits<double>::infinity())}));
   root.set("booleans", Value(Array{Value::Boolean(true), Value::Boolean(false)}));
-  root.set("dates",
-           Value(Array{Value::FromDate(Date{0}), Value::FromDate(Date{744076800}),
-                       Value::FromDate(Date{-31536000}),
-                       // Outside libplist's 32-bit seconds: years 1900 and 2200.
-                       Value::FromDate(Date{-3155673600.0}), Value::FromDate(Date{6311433600.0})}));
+  root.set(
+      "dates",
+      Value(Array{Value::FromDate(Date{0}), Value::FromDate(Date{744076800}),
+                  Value::FromDate(Date{-31536000}),
+                  // Outside libplist's 32-bit seconds: years 1900 and 2200.
+                  Value::FromDate(Date{-3155673600.0}), Value::FromDate(Date{6311433600.0}),
+                  // The first and the last second of years 1 to 9999.
+                  Value::FromDate(Date{-63113904000.0}), Value::FromDate(Date{252423993599.0})}));
   root.set("data", Value::FromData(bytes));
   root.set("emptyData", Value::FromData({}));
   root.set("emptyArray", Value(Array{}));
@@ -281,6 +284,9 @@ TEST(PropertyListHostile, InvalidUtf8ReadsAsNoValue) {
       BinaryList({"\x52\xC3\x28"}),                      // "ASCII" string with bad bytes
       BinaryList({"\x61\xD8\x00"s}),                     // UTF-16 lone high surrogate
       BinaryList({"\xD1\x01\x02", "\x51\xFF", "\x09"}),  // bad key
+      BinaryList({"\x53"
+                  "a\0b"s}),  // NUL that libplist would cut the string at
+      BinaryList({"\x61\x00\x00"s}),
   };
   for (const std::string& bytes : cases) EXPECT_FALSE(ReadPropertyList(bytes)) << bytes;
 }
