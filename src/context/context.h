@@ -82,6 +82,8 @@ class Context {
   plist::Dictionary mEventMetadata;
   std::unique_ptr<StatContext> mStats;
   bool mStatsTaken = false;
+  // Arrays and dictionaries being resolved around the current one; bounds the recursion.
+  int mResolveDepth = 0;
 };
 
 // The colon-escape convention: a colon is escaped when the run of backslashes right before it

@@ -1,0 +1,193 @@
+// Variable lookup, existence tests and assignment: the namespaces of a reference, its format
+// suffix, and the arithmetic assignment rule.
+
+#include <cstdint>
+
+#include "context/arithmetic.h"
+#include "context/context.h"
+#include "context/format_suffix.h"
+#include "context/keychain.h"
+#include "platform/diagnostic_log.h"
+
+namespace tarvod {
+namespace {
+
+constexpr std::string_view kBuiltinPrefix = "builtin:";
+constexpr std::string_view kEventPrefix = "event:";
+constexpr std::string_view kKeychainPrefix = "keychain:";
+constexpr std::string_view kGlobalPrefix = "global:";
+
+// White space and line breaks: the ASCII ones and the Unicode spaces and separators.
+bool IsSpaceOrLineBreak(uint32_t c) {
+  return c == ' ' || (c >= '\t' && c <= '\r') || c == 0x85 || c == 0xA0 || c == 0x1680 ||
+         (c >= 0x2000 && c <= 0x200A) || c == 0x2028 || c == 0x2029 || c == 0x202F || c == 0x205F ||
+         c == 0x3000;
+}
+
+// The code point of the UTF-8 sequence of length bytes at text[at]; strings are valid UTF-8.
+uint32_t CodePointAt(std::string_view text, size_t at, size_t length) {
+  const auto byte = [&](size_t i) { return static_cast<uint32_t>(static_cast<uint8_t>(text[i])); };
+  if (length == 1) return byte(at);
+  static constexpr uint32_t kLeadMask[] = {0, 0, 0x1F, 0x0F, 0x07};
+  uint32_t c = byte(at) & kLeadMask[length];
+  for (size_t i = 1; i < length; ++i) c = (c << 6) | (byte(at + i) & 0x3F);
+  return c;
+}
+
+size_t SequenceLength(uint8_t lead) {
+  if (lead < 0x80) return 1;
+  if (lead >= 0xF0) return 4;
+  if (lead >= 0xE0) return 3;
+  return 2;
+}
+
+std::string_view Trim(std::string_view text) {
+  while (!text.empty()) {
+    const size_t length = SequenceLength(static_cast<uint8_t>(text.front()));
+    if (length > text.size() || !IsSpaceOrLineBreak(CodePointAt(text, 0, length))) break;
+    text.remove_prefix(length);
+  }
+  while (!text.empty()) {
+    size_t start = text.size() - 1;
+    while (start > 0 && (static_cast<uint8_t>(text[start]) & 0xC0) == 0x80) --start;
+    if (!IsSpaceOrLineBreak(CodePointAt(text, start, text.size() - start))) break;
+    text.remove_suffix(text.size() - start);
+  }
+  return text;
+}
+
+std::optional<plist::Value> ValueIn(const plist::Dictionary* dictionary, std::string_view key) {
+  if (dictionary == nullptr) return std::nullopt;
+  const plist::Value* value = dictionary->find(key);
+  if (value == nullptr) return std::nullopt;
+  return *value;
+}
+
+// The variables dictionary of a scope (the globals or one rules file), created empty on first
+// use; a non-dictionary left under the key (a damaged state file) is replaced.
+plist::Dictionary* ScopeIn(VariableStore* store, std::string_view key) {
+  if (store == nullptr) return nullptr;
+  if (plist::Dictionary* scope = store->findDictionary(key)) return scope;
+  store->set(key, plist::Dictionary());
+  return store->findDictionary(key);
+}
+
+std::string TextOrNull(const std::optional<plist::Value>& value) {
+  return value ? value->textForm() : "(null)";
+}
+
+}  // namespace
+
+std::optional<plist::Value> Context::variableValueForKey(std::string_view reference,
+                                                         std::string_view rulesFile) {
+  if (reference.empty()) return std::nullopt;
+
+  // The format suffix runs from the last "%" to the end; without one, the name is taken as
+  // written, blanks included.
+  std::string_view name = reference;
+  std::string_view suffix;
+  if (const size_t percent = reference.rfind('%'); percent != std::string_view::npos) {
+    name = Trim(reference.substr(0, percent));
+    suffix = Trim(reference.substr(percent));
+  }
+
+  // The first matching namespace decides; there is no fallback between them, so a plain name
+  // never reaches the globals.
+  std::optional<plist::Value> value;
+  if (name.starts_with(kBuiltinPrefix)) {
+    value = valueForBuiltinVariableKey(name.substr(kBuiltinPrefix.size()));
+  } else if (name.starts_with(kEventPrefix)) {
+    value = ValueIn(event(), name.substr(kEventPrefix.size()));
+  } else if (name.starts_with(kKeychainPrefix)) {
+    if (auto password = ResolveKeychain(name.substr(kKeychainPrefix.size()))) {
+      value = plist::Value(std::move(*password));
+    }
+  } else if (name.starts_with(kGlobalPrefix)) {
+    if (mVariables) {
+      value = ValueIn(mVariables->findDictionary(kGlobalsKey), name.substr(kGlobalPrefix.size()));
+    }
+  } else if (UnescapedColonsInString(name)) {
+    value = ValueIn(&mEventMetadata, name);
+  } else if (!rulesFile.empty() && mVariables) {
+    value = ValueIn(mVariables->findDictionary(rulesFile), name);
+  }
+
+  if (suffix.empty()) return value;
+  return ApplyFormatSuffix(value, suffix);
+}
+
+bool Context::keyExists(std::string_view reference, std::string_view rulesFile) {
+  const bool exists = variableValueForKey(reference, rulesFile).has_value();
+  const std::string shown(reference);
+  LogMessage(6, "KeyExists: %s %s in the datastore", shown.c_str(),
+             exists ? "exists" : "does not exist");
+  return exists;
+}
+
+void Context::setVariableValue(const std::optional<plist::Value>& value, std::string_view name,
+                               std::string_view rulesFile) {
+  ErrorSlot error;
+  const std::optional<plist::Value> resolvedName =
+      resolveVariablesInString(std::string(name), rulesFile, &error);
+  if (error) {
+    LogMessage(0, "Error: %s", error->description.c_str());
+    return;
+  }
+  if (!resolvedName || !resolvedName->isString()) {
+    LogMessage(0, "The variable name %s is not a string. Skipping.",
+               TextOrNull(resolvedName).c_str());
+    return;
+  }
+  std::string_view variable = resolvedName->string();
+  const bool global = variable.starts_with(kGlobalPrefix);
+  if (global) variable.remove_prefix(kGlobalPrefix.size());
+  if (UnescapedColonsInString(variable)) {
+    const std::string shown(variable);
+    LogMessage(0, "Variable names cannot contain \":\" - skipping %s", shown.c_str());
+    return;
+  }
+
+  std::optional<plist::Value> stored = value;
+  if (value && value->isString()) {
+    LogMessage(4, "initial value = %s", value->string().c_str());
+    stored = resolveVariablesInString(value->string(), rulesFile, &error);
+    if (error) {
+      LogMessage(0, "Error: %s", error->description.c_str());
+      return;
+    }
+    LogMessage(4, "after resolveVarsInString value = %s", TextOrNull(stored).c_str());
+    // Purely arithmetic text becomes its number; the character test keeps ordinary text away
+    // from the evaluator.
+    if (stored && stored->isString() && IsArithmeticCandidate(stored->string())) {
+      ArithmeticResult result = EvaluateArithmetic(stored->string());
+      if (result.value) {
+        stored = std::move(result.value);
+      } else {
+        LogMessage(4, "Exception thrown while evaluating expression: %s\n%s\n",
+                   stored->string().c_str(), result.failure.c_str());
+      }
+    }
+  }
+
+  const std::string key(variable);
+  plist::Dictionary* scope = nullptr;
+  if (global) {
+    scope = ScopeIn(mVariables.get(), kGlobalsKey);
+  } else if (rulesFile.empty()) {
+    LogMessage(1, "Cannot set file local variable %s because the file path is nil", key.c_str());
+  } else {
+    scope = ScopeIn(mVariables.get(), rulesFile);
+  }
+  // The text form is taken before the value moves into the store, and only when it is shown.
+  const std::string shown = DebugLevel() >= 3 ? TextOrNull(stored) : std::string();
+  if (scope != nullptr) {
+    if (stored) {
+      scope->set(key, std::move(*stored));
+    } else {
+      scope->erase(key);
+    }
+  }
+  LogMessage(3, "  Set variable: %s = %s", key.c_str(), shown.c_str());
+}
+
+}  // namespace tarvod
