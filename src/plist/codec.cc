@@ -239,9 +239,10 @@ class BinaryChecker {
     mObjectsEnd = tableOffset;
     mTable = mData + tableOffset;
     mCount = count;
-    // Every expanded node is at least one reference byte of the input, except where objects
-    // are shared; the slack admits modest sharing.
-    mBudget = 2 * static_cast<uint64_t>(mSize) + 1024;
+    // Without shared containers every expanded node but the top one is a reference of at
+    // least one byte, so one node per input byte admits every such file; a shared container
+    // copied at each of its references cannot multiply the tree beyond that.
+    mBudget = static_cast<uint64_t>(mSize) + 1024;
     mState.assign(count, kUnvisited);
     mHeight.assign(count, 0);
     mExpanded.assign(count, 0);

@@ -154,13 +154,16 @@ TEST(PropertyListBinary, ReadsEveryKindThatLibplistWrites) {
   EXPECT_EQ(*back, EveryKind()) << Describe(*back);
 }
 
-TEST(PropertyListBinary, ReadsFractionalDatesAndWideIntegers) {
+TEST(PropertyListBinary, ReadsFractionalDatesWideIntegersAndUids) {
   const std::string date = BinaryList({"\x33\xC0\x24\x80\x00\x00\x00\x00\x00"s});  // -10.25
   EXPECT_EQ(ReadPropertyList(date)->date().secondsSince2001, -10.25);
   const std::string wideNegative = BinaryList({"\x14" + std::string(15, '\xFF') + "\xFB"});
   EXPECT_EQ(ReadPropertyList(wideNegative)->integer(), -5);
   const std::string widePositive = BinaryList({"\x14" + std::string(15, '\0') + "\x05"});
   EXPECT_EQ(ReadPropertyList(widePositive)->integer(), 5);
+  // A keyed-archive UID reads as the dictionary XML writes for it.
+  EXPECT_EQ(ReadPropertyList(BinaryList({"\x80\x05"})),
+            Value(Dictionary{{"CF$UID", Value::Integer(5)}}));
   // Past the 64-bit range: refused rather than wrapped.
   EXPECT_FALSE(
       ReadPropertyList(BinaryList({"\x14" + std::string(8, '\0') + std::string(8, '\xFF')})));
@@ -335,6 +338,11 @@ TEST(PropertyListHostile, BinaryOffsetsAndReferencesAreChecked) {
 }
 
 TEST(PropertyListHostile, SharedObjectsCannotMultiplyTheTree) {
+  // Writers share equal strings: 5,000 references to one string are an ordinary file.
+  const std::string shared = BinaryList({"\xAF\x11\x13\x88" + Repeat(Ref(1), 5000), "\x51x"});
+  const std::optional<Value> strings = ReadPropertyList(shared);
+  ASSERT_TRUE(strings);
+  EXPECT_EQ(strings->array().size(), 5000u);
   // Forty arrays each holding the next one twice: a tree of 2^40 nodes from 200 bytes.
   std::vector<std::string> objects;
   for (int i = 0; i < 40; ++i) objects.push_back("\xA2" + Ref(i + 1) + Ref(i + 1));
