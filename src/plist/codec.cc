@@ -243,6 +243,7 @@ class BinaryChecker {
     // least one byte, so one node per input byte admits every such file; a shared container
     // copied at each of its references cannot multiply the tree beyond that.
     mBudget = static_cast<uint64_t>(mSize) + 1024;
+    static_assert(kMaxFileSize + 1024 < (uint64_t{1} << 32), "expanded sizes are kept in 32 bits");
     mState.assign(count, kUnvisited);
     mHeight.assign(count, 0);
     mExpanded.assign(count, 0);
@@ -384,8 +385,8 @@ class BinaryChecker {
         const Frame done = frame;
         stack.pop_back();
         mState[done.index] = kDone;
-        mExpanded[done.index] = done.expanded;
-        mHeight[done.index] = done.height;
+        mExpanded[done.index] = static_cast<uint32_t>(done.expanded);
+        mHeight[done.index] = static_cast<uint16_t>(done.height);
         if (!stack.empty() && !addChild(stack.back(), done.expanded, done.height)) return false;
         continue;
       }
@@ -430,8 +431,10 @@ class BinaryChecker {
   uint64_t mCount = 0;
   uint64_t mBudget = 0;
   std::vector<State> mState;
-  std::vector<uint32_t> mHeight;
-  std::vector<uint64_t> mExpanded;
+  // Per declared object, so kept narrow: heights are at most kMaxNestingDepth and expanded
+  // sizes at most the budget, which is below 2^32 for any input within kMaxFileSize.
+  std::vector<uint16_t> mHeight;
+  std::vector<uint32_t> mExpanded;
 };
 
 // ---------------------------------------------------------------------------------------------
