@@ -101,12 +101,12 @@ std::optional<Conversion> ParseConversion(std::string_view suffix) {
   result.prefix = std::move(*prefix);
   result.trailer = std::move(*trailer);
 
-  const std::string_view spec = suffix.substr(percent + 1, trigger - percent - 1);
+  const std::string_view directive = suffix.substr(percent + 1, trigger - percent - 1);
   size_t i = 0;
   bool seen[5] = {};
   static constexpr char kFlags[] = "-+ #0";
-  for (; i < spec.size(); ++i) {
-    const char c = spec[i];
+  for (; i < directive.size(); ++i) {
+    const char c = directive[i];
     if (c == '\'') continue;  // digit grouping: the daemon formats in the C locale, a no-op
     bool isFlag = false;
     for (int f = 0; f < 5; ++f) {
@@ -117,14 +117,14 @@ std::optional<Conversion> ParseConversion(std::string_view suffix) {
     }
     if (!isFlag) break;
   }
-  if (i < spec.size() && IsDigit(spec[i])) result.width = ReadClamped(spec, i, kMaxWidth);
-  if (i < spec.size() && spec[i] == '.') {
+  if (i < directive.size() && IsDigit(directive[i])) result.width = ReadClamped(directive, i, kMaxWidth);
+  if (i < directive.size() && directive[i] == '.') {
     ++i;
-    result.precision = ReadClamped(spec, i, kMaxPrecision);
+    result.precision = ReadClamped(directive, i, kMaxPrecision);
   }
   // Length modifiers are read and dropped: the argument's type is chosen below.
-  for (; i < spec.size(); ++i) {
-    const char c = spec[i];
+  for (; i < directive.size(); ++i) {
+    const char c = directive[i];
     if (c != 'h' && c != 'l' && c != 'L' && c != 'q' && c != 'j' && c != 'z' && c != 't') {
       return std::nullopt;
     }
