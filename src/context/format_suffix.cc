@@ -117,7 +117,8 @@ std::optional<Conversion> ParseConversion(std::string_view suffix) {
     }
     if (!isFlag) break;
   }
-  if (i < directive.size() && IsDigit(directive[i])) result.width = ReadClamped(directive, i, kMaxWidth);
+  if (i < directive.size() && IsDigit(directive[i]))
+    result.width = ReadClamped(directive, i, kMaxWidth);
   if (i < directive.size() && directive[i] == '.') {
     ++i;
     result.precision = ReadClamped(directive, i, kMaxPrecision);
