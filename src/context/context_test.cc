@@ -1,0 +1,186 @@
+#include "context/context.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+
+#include "platform/diagnostic_log.h"
+
+namespace tarvod {
+namespace {
+
+using plist::Dictionary;
+using plist::Value;
+
+// Points the error log at a temporary file for the test's duration.
+class ContextTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/tarvod-context-XXXXXX";
+    ASSERT_NE(mkdtemp(pattern), nullptr);
+    dir_ = pattern;
+    log_ = dir_ + "/error.log";
+    const int fd = SafeOpen(log_.c_str(), 0600, O_WRONLY | O_APPEND);
+    ASSERT_GE(fd, 0);
+    AttachErrorLog(fd);
+    SetDebugLevel(6);
+  }
+  void TearDown() override {
+    SetMeminfoPathForTesting("");
+    CloseLogs();
+    std::system(("rm -rf " + dir_).c_str());
+  }
+  std::string Log() const {
+    std::ifstream in(log_);
+    std::ostringstream s;
+    s << in.rdbuf();
+    return s.str();
+  }
+  void WriteMeminfo(int freeKb) {
+    std::ofstream(dir_ + "/meminfo")
+        << "MemFree: " << freeKb << " kB\nActive: 16 kB\nInactive: 32 kB\nUnevictable: 64 kB\n";
+    SetMeminfoPathForTesting(dir_ + "/meminfo");
+  }
+  std::string dir_, log_;
+};
+
+TEST(ColonEscapes, FollowTheOddBackslashRunConvention) {
+  struct Case {
+    std::string text, escaped, unescaped;
+    bool hasUnescapedColon;
+  };
+  const Case cases[] = {
+      {"", "", "", false},
+      {"abc", "abc", "abc", false},
+      {"12:30", R"(12\:30)", "12:30", true},
+      {R"(12\:30)", R"(12\:30)", "12:30", false},
+      {"a:b:c", R"(a\:b\:c)", "a:b:c", true},
+      {R"(a\\:b)", R"(a\\\:b)", R"(a\\:b)", true},
+      {R"(a\\\:b)", R"(a\\\:b)", R"(a\\:b)", false},
+      {":", R"(\:)", ":", true},
+      {R"(\x:)", R"(\x\:)", R"(\x:)", true},  // a backslash's flag is cleared by the next character
+      {R"(end\)", R"(end\)", R"(end\)", false},
+  };
+  for (const Case& c : cases) {
+    EXPECT_EQ(EscapeColonsInEventString(c.text), c.escaped) << c.text;
+    EXPECT_EQ(UnescapeColonsInString(c.text), c.unescaped) << c.text;
+    EXPECT_EQ(UnescapedColonsInString(c.text), c.hasUnescapedColon) << c.text;
+  }
+}
+
+TEST(ColonEscapes, UnescapingUndoesEscapingOfTextWithoutEscapedColons) {
+  for (const char* text : {"a:b", "::", R"(a\\:b)", "host:8080:x", R"(\\\\:)", "é:ü"}) {
+    const std::string escaped = EscapeColonsInEventString(text);
+    EXPECT_FALSE(UnescapedColonsInString(escaped)) << text;
+    EXPECT_EQ(UnescapeColonsInString(escaped), text);
+  }
+}
+
+TEST_F(ContextTest, ImportLiftsDetailsEscapesTheirStringsAndKeepsTopLevelValues) {
+  const Dictionary incoming{
+      {"eventType", "auth.failure"},
+      {"eventSource", "a:b"},
+      {"eventDetails", Dictionary{{"time", "12:30"},
+                                  {"count", Value::Integer(3)},
+                                  {"list", plist::Array{"x:y"}},
+                                  {"eventType", "from.details"}}},
+  };
+  const Dictionary before = incoming;
+  Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>(), incoming);
+  ASSERT_NE(context.event(), nullptr);
+  const Dictionary& event = *context.event();
+  EXPECT_EQ(*event.findString("time"), R"(12\:30)");
+  EXPECT_EQ(*event.find("count"), Value::Integer(3));
+  EXPECT_EQ(*event.find("list"), Value(plist::Array{"x:y"}));  // not descended into
+  EXPECT_EQ(*event.findString("eventType"), "auth.failure");   // top level wins
+  EXPECT_EQ(*event.findString("eventSource"), "a:b");          // top level is not escaped
+  EXPECT_FALSE(event.contains("eventDetails"));
+  EXPECT_EQ(event.size(), 5u);
+  EXPECT_EQ(incoming, before);
+  EXPECT_EQ(Log(),
+            "key = time before escape 12:30\nafter escape 12\\:30\n"
+            "key = eventType before escape from.details\nafter escape from.details\n");
+}
+
+TEST_F(ContextTest, EventsWithoutUsableDetailsImportTheirTopLevelOnly) {
+  const Dictionary cases[] = {
+      {{"eventType", "a"}},
+      {{"eventType", "a"}, {"eventDetails", "not a dictionary"}},
+  };
+  for (const Dictionary& incoming : cases) {
+    Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>(), incoming);
+    ASSERT_NE(context.event(), nullptr);
+    EXPECT_EQ(*context.event(), (Dictionary{{"eventType", "a"}}));
+  }
+  Context without(std::make_shared<VariableStore>(), std::make_shared<Rulebase>());
+  EXPECT_EQ(without.event(), nullptr);
+  EXPECT_TRUE(without.eventMetadata().empty());
+}
+
+TEST_F(ContextTest, SettingAnotherEventReplacesTheFirst) {
+  Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>(),
+                  Dictionary{{"eventType", "a"}, {"eventDetails", Dictionary{{"x", "1"}}}});
+  context.setEvent(Dictionary{{"eventType", "b"}});
+  EXPECT_EQ(*context.event(), (Dictionary{{"eventType", "b"}}));
+}
+
+TEST_F(ContextTest, ImportOfAnEventWithManyKeysKeepsEveryKeyOnce) {
+  std::vector<Dictionary::Entry> details, top;
+  for (int i = 0; i < 20000; ++i) {
+    details.emplace_back("k" + std::to_string(i), Value("d"));
+    top.emplace_back("k" + std::to_string(i * 2), Value("t"));
+  }
+  top.emplace_back("eventDetails", Value(Dictionary::FromEntries(details)));
+  SetDebugLevel(0);
+  Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>(),
+                  Dictionary::FromEntries(top));
+  EXPECT_EQ(context.event()->size(), 30000u);
+  EXPECT_EQ(*context.event()->findString("k2"), "t");
+  EXPECT_EQ(*context.event()->findString("k3"), "d");
+}
+
+TEST_F(ContextTest, DescriptionPrintsEventVariablesAndRulebase) {
+  auto variables = std::make_shared<VariableStore>(
+      VariableStore{{kGlobalsKey, Dictionary{{"g", Value::Integer(1)}}}});
+  Context without(variables, std::make_shared<Rulebase>());
+  EXPECT_EQ(without.description(),
+            "event = (null) \n variables = " + plist::Describe(*variables) + " \n rulebase = {}");
+  Context with(variables, std::make_shared<Rulebase>(), Dictionary{{"eventType", "a"}});
+  EXPECT_EQ(with.description(), "event = " + plist::Describe(*with.event()) + " \n variables = " +
+                                    plist::Describe(*variables) + " \n rulebase = {}");
+  Context nothing(nullptr, nullptr);
+  EXPECT_EQ(nothing.description(), "event = (null) \n variables = (null) \n rulebase = (null)");
+}
+
+TEST_F(ContextTest, StatisticsAreTakenAtFirstUseAndThenKept) {
+  SetMeminfoPathForTesting(dir_ + "/missing");
+  Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>());
+  WriteMeminfo(8);  // present by the time a rule first reads a "system:" value
+  const StatContext* first = context.stats();
+  ASSERT_NE(first, nullptr);
+  const uint32_t freePages = first->counters[0];
+  WriteMeminfo(8000);
+  EXPECT_EQ(context.stats(), first);
+  EXPECT_EQ(context.stats()->counters[0], freePages);
+  EXPECT_EQ(context.variableValueForKey("builtin:system:memory:free", ""),
+            context.variableValueForKey("builtin:system:memory:free", ""));
+}
+
+TEST_F(ContextTest, AContextWithoutStatisticsServesEveryOtherVariable) {
+  SetMeminfoPathForTesting(dir_ + "/missing");
+  auto variables = std::make_shared<VariableStore>();
+  Context context(variables, std::make_shared<Rulebase>(), Dictionary{{"eventType", "a"}});
+  EXPECT_EQ(context.stats(), nullptr);
+  EXPECT_EQ(context.stats(), nullptr);
+  context.setVariableValue(Value("1"), "global:g", "");
+  EXPECT_EQ(context.variableValueForKey("builtin:system:memory:free", ""), Value("rule-error"));
+  EXPECT_EQ(context.variableValueForKey("global:g", ""), Value::Integer(1));
+  EXPECT_EQ(context.variableValueForKey("event:eventType", ""), Value("a"));
+}
+
+}  // namespace
+}  // namespace tarvod
