@@ -121,13 +121,6 @@ TEST_F(ContextTest, EventsWithoutUsableDetailsImportTheirTopLevelOnly) {
   EXPECT_TRUE(without.eventMetadata().empty());
 }
 
-TEST_F(ContextTest, SettingAnotherEventReplacesTheFirst) {
-  Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>(),
-                  Dictionary{{"eventType", "a"}, {"eventDetails", Dictionary{{"x", "1"}}}});
-  context.setEvent(Dictionary{{"eventType", "b"}});
-  EXPECT_EQ(*context.event(), (Dictionary{{"eventType", "b"}}));
-}
-
 TEST_F(ContextTest, ImportOfAnEventWithManyKeysKeepsEveryKeyOnce) {
   std::vector<Dictionary::Entry> details, top;
   for (int i = 0; i < 20000; ++i) {

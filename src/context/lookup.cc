@@ -1,8 +1,6 @@
 // Variable lookup, existence tests and assignment: the namespaces of a reference, its format
 // suffix, and the arithmetic assignment rule.
 
-#include <cstdint>
-
 #include "context/arithmetic.h"
 #include "context/context.h"
 #include "context/format_suffix.h"
@@ -17,42 +15,30 @@ constexpr std::string_view kEventPrefix = "event:";
 constexpr std::string_view kKeychainPrefix = "keychain:";
 constexpr std::string_view kGlobalPrefix = "global:";
 
-// White space and line breaks: the ASCII ones and the Unicode spaces and separators.
-bool IsSpaceOrLineBreak(uint32_t c) {
-  return c == ' ' || (c >= '\t' && c <= '\r') || c == 0x85 || c == 0xA0 || c == 0x1680 ||
-         (c >= 0x2000 && c <= 0x200A) || c == 0x2028 || c == 0x2029 || c == 0x202F || c == 0x205F ||
-         c == 0x3000;
-}
+// White space and line breaks beyond ASCII, in UTF-8: the Unicode space separators, the
+// next-line character and the line and paragraph separators.
+constexpr std::string_view kUnicodeSpaces[] = {
+    "\u0085", "\u00a0", "\u1680", "\u2000", "\u2001", "\u2002", "\u2003",
+    "\u2004", "\u2005", "\u2006", "\u2007", "\u2008", "\u2009", "\u200a",
+    "\u2028", "\u2029", "\u202f", "\u205f", "\u3000",
+};
 
-// The code point of the UTF-8 sequence of length bytes at text[at]; strings are valid UTF-8.
-uint32_t CodePointAt(std::string_view text, size_t at, size_t length) {
-  const auto byte = [&](size_t i) { return static_cast<uint32_t>(static_cast<uint8_t>(text[i])); };
-  if (length == 1) return byte(at);
-  static constexpr uint32_t kLeadMask[] = {0, 0, 0x1F, 0x0F, 0x07};
-  uint32_t c = byte(at) & kLeadMask[length];
-  for (size_t i = 1; i < length; ++i) c = (c << 6) | (byte(at + i) & 0x3F);
-  return c;
-}
+bool IsAsciiSpace(char c) { return c == ' ' || (c >= '\t' && c <= '\r'); }
 
-size_t SequenceLength(uint8_t lead) {
-  if (lead < 0x80) return 1;
-  if (lead >= 0xF0) return 4;
-  if (lead >= 0xE0) return 3;
-  return 2;
+// Byte length of the white space or line break that text begins with (ends with, when
+// atEnd), 0 when there is none.
+size_t SpaceLength(std::string_view text, bool atEnd) {
+  if (text.empty()) return 0;
+  if (IsAsciiSpace(atEnd ? text.back() : text.front())) return 1;
+  for (const std::string_view space : kUnicodeSpaces) {
+    if (atEnd ? text.ends_with(space) : text.starts_with(space)) return space.size();
+  }
+  return 0;
 }
 
 std::string_view Trim(std::string_view text) {
-  while (!text.empty()) {
-    const size_t length = SequenceLength(static_cast<uint8_t>(text.front()));
-    if (length > text.size() || !IsSpaceOrLineBreak(CodePointAt(text, 0, length))) break;
-    text.remove_prefix(length);
-  }
-  while (!text.empty()) {
-    size_t start = text.size() - 1;
-    while (start > 0 && (static_cast<uint8_t>(text[start]) & 0xC0) == 0x80) --start;
-    if (!IsSpaceOrLineBreak(CodePointAt(text, start, text.size() - start))) break;
-    text.remove_suffix(text.size() - start);
-  }
+  while (const size_t length = SpaceLength(text, false)) text.remove_prefix(length);
+  while (const size_t length = SpaceLength(text, true)) text.remove_suffix(length);
   return text;
 }
 

@@ -245,13 +245,11 @@ TEST_F(LookupTest, AssignmentsAreVisibleToEveryContextOfTheStore) {
   EXPECT_EQ(context_->variableValueForKey("global:copied", ""), Value("alpha and more"));
   other.setVariableValue(std::nullopt, "global:copied", kFile);
   EXPECT_EQ(context_->variableValueForKey("global:copied", ""), std::nullopt);
-}
 
-TEST_F(LookupTest, AStoreWithoutGlobalsGetsThemAtTheFirstGlobalAssignment) {
-  auto variables = std::make_shared<VariableStore>();
-  Context context(variables, std::make_shared<Rulebase>());
-  context.setVariableValue(Value("1"), "global:g", "");
-  EXPECT_EQ(context.variableValueForKey("global:g", ""), Value::Integer(1));
+  // A store without globals gets them at the first global assignment.
+  Context bare(std::make_shared<VariableStore>(), std::make_shared<Rulebase>());
+  bare.setVariableValue(Value("1"), "global:g", "");
+  EXPECT_EQ(bare.variableValueForKey("global:g", ""), Value::Integer(1));
 }
 
 }  // namespace
