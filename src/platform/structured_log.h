@@ -19,8 +19,18 @@ class StructuredLog {
   virtual bool send(int priority, std::string_view message, const LogAttributes& attributes) = 0;
 };
 
-// Selects the sink: the journal when path is empty, else the JSON-lines file at path.
+// Selects the sink: the journal when path is empty, else the JSON-lines file at path (one
+// object per line: identifier, priority, message, attributes under their own names). Until
+// the first call the sink is the journal.
 void ConfigureStructuredLog(const std::string& jsonLinesPath);
+// The sink in use. The reference stays valid for the life of the process.
 StructuredLog& DefaultStructuredLog();
+
+// The journal field that carries an attribute: the name upper-cased, every character outside
+// A-Z, 0-9 and "_" replaced by "_"; an "A" put in front when the result is empty, begins with
+// a digit or "_", or is a field the journal or the record itself uses (MESSAGE, PRIORITY,
+// SYSLOG_IDENTIFIER, ...); then cut to 64 characters. "clientIP" -> CLIENTIP, "message" ->
+// AMESSAGE, "1st-try" -> A1ST_TRY.
+std::string JournalFieldName(std::string_view attribute);
 
 }  // namespace tarvod

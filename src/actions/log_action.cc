@@ -1,0 +1,180 @@
+#include "actions/log_action.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+
+#include "platform/diagnostic_log.h"
+#include "platform/structured_log.h"
+
+namespace tarvod {
+namespace {
+
+using LevelTable = std::array<std::pair<std::string_view, int>, 8>;
+
+constexpr int kNoticeSeverity = 5;
+
+// The syslog severities, in the order the complaint about a bad level lists them.
+const LevelTable* gLevelNames = nullptr;
+
+const LevelTable& LevelNames() {
+  BuildLevelNameTable();
+  return *gLevelNames;
+}
+
+std::string LowerCase(std::string text) {
+  for (char& c : text) {
+    if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
+  }
+  return text;
+}
+
+// The severity a logLevel value names. A name outside the table is treated like a value that
+// is no string at all (the complaint, then notice): reading a missing entry as 0 would turn a
+// misspelt "warnig" into an emergency.
+int Severity(const plist::Value* logLevel) {
+  if (logLevel != nullptr && logLevel->isString()) {
+    const std::string name = LowerCase(logLevel->string());
+    for (const auto& [levelName, severity] : LevelNames()) {
+      if (levelName == name) return severity;
+    }
+  }
+  std::string valid;
+  for (const auto& [levelName, severity] : LevelNames()) {
+    if (!valid.empty()) valid += ", ";
+    valid += levelName;
+  }
+  LogMessage(0,
+             "The value for %s is not a valid level string. Using notice level. Valid strings "
+             "are:\n%s",
+             "logLevel", valid.c_str());
+  return kNoticeSeverity;
+}
+
+// Text form of an action key, resolved. nullopt means "stop": the error was logged. An absent
+// key, or a reference to nothing, gives an absent text.
+std::optional<std::optional<std::string>> ResolvedText(const plist::Dictionary& action,
+                                                       std::string_view key,
+                                                       const std::string& filePath,
+                                                       Context& context) {
+  const plist::Value* value = action.find(key);
+  if (value == nullptr) return std::optional<std::string>();
+  ErrorSlot error;
+  std::optional<plist::Value> resolved =
+      context.resolveVariablesInString(value->textForm(), filePath, &error);
+  if (error) {
+    LogMessage(0, "Error: %s", error->description.c_str());
+    return std::nullopt;
+  }
+  if (!resolved) return std::optional<std::string>();
+  return std::optional<std::string>(resolved->textForm());
+}
+
+void LogToStructuredLog(const plist::Dictionary& action, const std::string& logType,
+                        const std::string& message, const std::string& filePath, Context& context) {
+  LogAttributes attributes;
+  if (const plist::Value* facility = action.find("facility")) {
+    attributes.emplace_back("Facility", facility->textForm());
+  }
+  if (logType == "kvlog") {
+    if (const plist::Value* details = action.find("details")) {
+      if (!details->isDictionary()) {
+        LogMessage(0, "The value for %s is not a dictionary. Aborting log action.", "details");
+        return;
+      }
+      ErrorSlot error;
+      std::optional<plist::Value> resolved =
+          context.resolveVariablesInDictionary(details->dictionary(), filePath, &error);
+      if (error) {
+        LogMessage(0, "Error: %s", error->description.c_str());
+        return;
+      }
+      if (resolved && resolved->isDictionary()) {
+        for (const auto& [key, value] : resolved->dictionary()) {
+          attributes.emplace_back(key, value.textForm());
+        }
+      }
+    }
+  }
+  const int severity = Severity(action.find("logLevel"));
+  // The message travels as data, never as a format: "%" in it reaches the log unchanged.
+  if (!DefaultStructuredLog().send(severity, message, attributes)) {
+    LogMessage(0, "DoLogAction: Cannot send message to the structured log");
+  }
+}
+
+void LogToFile(const std::string& path, const std::string& message) {
+  // Neither truncated nor appending: the seek to the end is what places the line.
+  const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+  if (fd < 0) {
+    LogMessage(0, "LOG: Cannot open %s errno = %d", path.c_str(), errno);
+    return;
+  }
+  lseek(fd, 0, SEEK_END);
+  errno = 0;
+  const ssize_t written = write(fd, message.data(), message.size());
+  if (written < 0 || static_cast<size_t>(written) != message.size()) {
+    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
+  }
+  errno = 0;
+  if (write(fd, "\n", 1) != 1) {
+    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
+  }
+  close(fd);
+}
+
+}  // namespace
+
+void BuildLevelNameTable() {
+  static std::once_flag once;
+  std::call_once(once, [] {
+    static const LevelTable table = {{
+        {"emergency", 0},
+        {"alert", 1},
+        {"critical", 2},
+        {"error", 3},
+        {"warning", 4},
+        {"notice", 5},
+        {"info", 6},
+        {"debug", 7},
+    }};
+    gLevelNames = &table;
+  });
+}
+
+void DoLogAction(const plist::Dictionary& action, const Rule& rule, Context& context) {
+  const plist::Value* filePathValue = rule.find("filePath");
+  const std::string filePath = filePathValue ? filePathValue->textForm() : std::string();
+
+  const auto resolvedMessage = ResolvedText(action, "message", filePath, context);
+  if (!resolvedMessage) return;
+  if (!*resolvedMessage || (*resolvedMessage)->empty()) return;
+  const std::string message = UnescapeColonsInString(**resolvedMessage);
+  if (message.empty()) return;
+
+  const auto logType = ResolvedText(action, "logType", filePath, context);
+  if (!logType) return;
+  const std::string type = *logType ? LowerCase(**logType) : std::string();
+
+  // Resolved even for the structured log: an error in it ends the action either way.
+  const auto logPath = ResolvedText(action, "logPath", filePath, context);
+  if (!logPath) return;
+
+  LogMessage(3, "DoLogAction: logMessage is [%s]", message.c_str());
+
+  if (type == "syslog" || type == "kvlog") {
+    LogToStructuredLog(action, type, message, filePath, context);
+    return;
+  }
+  if (!*logPath) return;
+  LogToFile(**logPath, message);
+}
+
+}  // namespace tarvod

@@ -1,1 +1,0 @@
-// Handlers of the rules' actions.

@@ -1,0 +1,183 @@
+#include "platform/structured_log.h"
+
+#include <fcntl.h>
+#include <sys/uio.h>
+#include <systemd/sd-journal.h>
+#include <unistd.h>
+
+#include <array>
+#include <atomic>
+#include <cerrno>
+#include <cstdio>
+#include <memory>
+#include <mutex>
+#include <string>
+
+namespace tarvod {
+namespace {
+
+// Journal fields the record itself writes, or that the journal reads with a meaning of its
+// own. An attribute whose field name would be one of these gets the "A" prefix, so that an
+// event key such as "message" can never replace the record's text or its priority.
+constexpr std::array<std::string_view, 20> kReservedFields = {
+    "MESSAGE",           "MESSAGE_ID",         "PRIORITY",
+    "SYSLOG_IDENTIFIER", "SYSLOG_FACILITY",    "SYSLOG_PID",
+    "SYSLOG_TIMESTAMP",  "SYSLOG_RAW",         "CODE_FILE",
+    "CODE_LINE",         "CODE_FUNC",          "ERRNO",
+    "INVOCATION_ID",     "USER_INVOCATION_ID", "UNIT",
+    "USER_UNIT",         "DOCUMENTATION",      "TID",
+    "OBJECT_PID",        "COREDUMP_UNIT",
+};
+
+// The journal takes field names of at most 64 characters.
+constexpr size_t kMaxFieldName = 64;
+
+void AppendJsonString(std::string& out, std::string_view text) {
+  out += '"';
+  for (const char c : text) {
+    const auto u = static_cast<unsigned char>(c);
+    switch (c) {
+      case '"':
+        out += "\\\"";
+        break;
+      case '\\':
+        out += "\\\\";
+        break;
+      case '\n':
+        out += "\\n";
+        break;
+      case '\r':
+        out += "\\r";
+        break;
+      case '\t':
+        out += "\\t";
+        break;
+      default:
+        if (u < 0x20 || u == 0x7f) {
+          char escaped[8];
+          std::snprintf(escaped, sizeof escaped, "\\u%04x", u);
+          out += escaped;
+        } else {
+          out += c;  // strings are valid UTF-8 by the time they reach a record
+        }
+    }
+  }
+  out += '"';
+}
+
+class JournalLog final : public StructuredLog {
+ public:
+  bool send(int priority, std::string_view message, const LogAttributes& attributes) override {
+    std::vector<std::string> fields;
+    fields.reserve(attributes.size() + 3);
+    fields.push_back("SYSLOG_IDENTIFIER=tarvod");
+    fields.push_back("PRIORITY=" + std::to_string(priority));
+    fields.push_back("MESSAGE=" + std::string(message));
+    for (const auto& [name, value] : attributes) {
+      fields.push_back(JournalFieldName(name) + "=" + value);
+    }
+    std::vector<iovec> vectors(fields.size());
+    for (size_t i = 0; i < fields.size(); ++i) {
+      vectors[i].iov_base = fields[i].data();
+      vectors[i].iov_len = fields[i].size();
+    }
+    // sd_journal_sendv is safe to call from several threads at once.
+    return sd_journal_sendv(vectors.data(), static_cast<int>(vectors.size())) >= 0;
+  }
+};
+
+class JsonLinesLog final : public StructuredLog {
+ public:
+  explicit JsonLinesLog(std::string path) : mPath(std::move(path)) {}
+
+  bool send(int priority, std::string_view message, const LogAttributes& attributes) override {
+    std::string line = "{\"identifier\": \"tarvod\", \"priority\": " + std::to_string(priority) +
+                       ", \"message\": ";
+    AppendJsonString(line, message);
+    line += ", \"attributes\": {";
+    bool first = true;
+    for (const auto& [name, value] : attributes) {
+      if (!first) line += ", ";
+      first = false;
+      AppendJsonString(line, name);
+      line += ": ";
+      AppendJsonString(line, value);
+    }
+    line += "}}\n";
+
+    // One lock around open and write keeps lines from interleaving; the file is opened per
+    // record so that it can be rotated away underneath the daemon.
+    std::lock_guard<std::mutex> guard(mLock);
+    const int fd =
+        open(mPath.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW, 0644);
+    if (fd < 0) return false;
+    size_t written = 0;
+    while (written < line.size()) {
+      const ssize_t n = write(fd, line.data() + written, line.size() - written);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) break;
+      written += static_cast<size_t>(n);
+    }
+    close(fd);
+    return written == line.size();
+  }
+
+ private:
+  const std::string mPath;
+  std::mutex mLock;
+};
+
+// Every sink ever made lives until the process ends, so a reference that DefaultStructuredLog
+// returned stays valid on other threads after a reconfiguration.
+std::mutex gSinkLock;
+std::vector<std::unique_ptr<StructuredLog>> gSinks;
+std::atomic<StructuredLog*> gCurrent{nullptr};
+
+void Install(std::unique_ptr<StructuredLog> sink) {
+  std::lock_guard<std::mutex> guard(gSinkLock);
+  gCurrent.store(sink.get());
+  gSinks.push_back(std::move(sink));
+}
+
+}  // namespace
+
+std::string JournalFieldName(std::string_view attribute) {
+  std::string field;
+  field.reserve(attribute.size() + 1);
+  for (const char c : attribute) {
+    if (c >= 'a' && c <= 'z') {
+      field += static_cast<char>(c - 'a' + 'A');
+    } else if ((c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '_') {
+      field += c;
+    } else {
+      field += '_';
+    }
+  }
+  bool prefix = field.empty() || field[0] == '_' || (field[0] >= '0' && field[0] <= '9');
+  for (const std::string_view reserved : kReservedFields) {
+    if (field == reserved) prefix = true;
+  }
+  if (prefix) field.insert(field.begin(), 'A');
+  if (field.size() > kMaxFieldName) field.resize(kMaxFieldName);
+  return field;
+}
+
+void ConfigureStructuredLog(const std::string& jsonLinesPath) {
+  if (jsonLinesPath.empty()) {
+    Install(std::make_unique<JournalLog>());
+  } else {
+    Install(std::make_unique<JsonLinesLog>(jsonLinesPath));
+  }
+}
+
+StructuredLog& DefaultStructuredLog() {
+  if (StructuredLog* current = gCurrent.load()) return *current;
+  std::lock_guard<std::mutex> guard(gSinkLock);
+  if (gCurrent.load() == nullptr) {
+    gSinks.push_back(std::make_unique<JournalLog>());
+    gCurrent.store(gSinks.back().get());
+  }
+  return *gCurrent.load();
+}
+
+}  // namespace tarvod
