@@ -10,14 +10,17 @@
 #include <optional>
 #include <string>
 
+#include "actions/log_action.h"
 #include "context/types.h"
 #include "daemon/configuration.h"
 #include "daemon/logs.h"
 #include "daemon/signals.h"
+#include "engine/dispatch.h"
 #include "engine/keyword_tables.h"
 #include "engine/rules_loader.h"
 #include "platform/diagnostic_log.h"
 #include "platform/host_stats.h"
+#include "platform/structured_log.h"
 #include "plist/value.h"
 #include "sources/event_listener.h"
 #include "sources/monitor.h"
@@ -153,9 +156,9 @@ int DaemonMain(int argc, char** argv) {
   configuration.set("rulesPath", plist::Value(rulesPath));
 
   BuildKeywordTables();
-  // Step 13: level-name table.
+  BuildLevelNameTable();
   InitHostStats();
-  // Structured log sink.
+  ConfigureStructuredLog(ConfigurationString(configuration, "structuredLogPath", ""));
 
   // Steps 15 to 18: the rules.
   auto rulebase = std::make_shared<Rulebase>();
@@ -179,7 +182,7 @@ int DaemonMain(int argc, char** argv) {
   };
   monitor->setEventFilterUID(ParseFilterList(filterText("filterByUID")),
                              ParseFilterList(filterText("filterByGID")));
-  // Step 21: raise startup.load.
+  PostStartupEvent(rulebase, variables, false);
   // Step 22: periodic events.
   // Step 23: notification observers.
   // Step 24: begin listening.
@@ -206,7 +209,8 @@ int DaemonMain(int argc, char** argv) {
     }
   }
 
-  // Shutdown event.
+  PostShutdownEvent(rulebase, variables);
+  ProcessingQueue().drain();  // the shutdown rules run before the logs close
   // Stop the sources.
   monitor->stopListening();
   LogMessage(0, "Velkin Shutdown at %s", NowText().c_str());
