@@ -58,11 +58,12 @@ size_t LoadRulesFile(const RulebasePtr& rulebase, const VariableStorePtr& variab
       LogMessage(3, "  Skipping disabled rule: %s", name.c_str());
       continue;
     }
+    // Copied before filePath is added: adding a key may move the entries eventTypes points into.
+    const plist::Array types = *eventTypes;
     source->set("filePath", plist::Value(path));
     if (const plist::Value* loadWith = source->find("loadVariablesWithRule")) {
       AssignLoadTimeVariables(rulebase, variables, loadWith->textForm(), path);
     }
-    const plist::Array types = *eventTypes;
     auto rule = std::make_shared<const Rule>(std::move(*source));
     for (const plist::Value& type : types) {
       // Types are matched as exact strings; anything else in the list cannot match an event.
