@@ -10,6 +10,7 @@
 
 #include "context/context.h"
 #include "platform/diagnostic_log.h"
+#include "platform/testing/log_capture.h"
 
 namespace tarvod {
 namespace {
@@ -19,33 +20,20 @@ using plist::Value;
 class BuiltinsTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char pattern[] = "/tmp/tarvod-builtins-XXXXXX";
-    dir_ = mkdtemp(pattern);
-    log_ = dir_ + "/error.log";
-    const int fd = SafeOpen(log_.c_str(), 0600, O_WRONLY | O_APPEND);
-    ASSERT_GE(fd, 0);
-    AttachErrorLog(fd);
+    dir_ = capture_.directory();
     SetDebugLevel(0);
     meminfo_ = dir_ + "/meminfo";
     std::ofstream(meminfo_)
         << "MemFree: 8 kB\nActive: 16 kB\nInactive: 32 kB\nUnevictable: 64 kB\n";
     SetMeminfoPathForTesting(meminfo_);
   }
-  void TearDown() override {
-    SetMeminfoPathForTesting("");
-    CloseLogs();
-    std::system(("rm -rf " + dir_).c_str());
-  }
-  std::string Log() const {
-    std::ifstream in(log_);
-    std::ostringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
+  void TearDown() override { SetMeminfoPathForTesting(""); }
+  std::string Log() const { return capture_.text(); }
   Context MakeContext() {
     return Context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>());
   }
-  std::string dir_, log_, meminfo_;
+  testing::LogCapture capture_;
+  std::string dir_, meminfo_;
 };
 
 double Number(const std::optional<Value>& v) { return v ? v->numberValue() : -1; }

@@ -9,6 +9,7 @@
 #include <sstream>
 
 #include "platform/diagnostic_log.h"
+#include "platform/testing/log_capture.h"
 
 namespace tarvod {
 namespace {
@@ -20,32 +21,18 @@ using plist::Value;
 class ContextTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char pattern[] = "/tmp/tarvod-context-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern), nullptr);
-    dir_ = pattern;
-    log_ = dir_ + "/error.log";
-    const int fd = SafeOpen(log_.c_str(), 0600, O_WRONLY | O_APPEND);
-    ASSERT_GE(fd, 0);
-    AttachErrorLog(fd);
+    dir_ = capture_.directory();
     SetDebugLevel(6);
   }
-  void TearDown() override {
-    SetMeminfoPathForTesting("");
-    CloseLogs();
-    std::system(("rm -rf " + dir_).c_str());
-  }
-  std::string Log() const {
-    std::ifstream in(log_);
-    std::ostringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
+  void TearDown() override { SetMeminfoPathForTesting(""); }
+  std::string Log() const { return capture_.text(); }
   void WriteMeminfo(int freeKb) {
     std::ofstream(dir_ + "/meminfo")
         << "MemFree: " << freeKb << " kB\nActive: 16 kB\nInactive: 32 kB\nUnevictable: 64 kB\n";
     SetMeminfoPathForTesting(dir_ + "/meminfo");
   }
-  std::string dir_, log_;
+  testing::LogCapture capture_;
+  std::string dir_;
 };
 
 TEST(ColonEscapes, FollowTheOddBackslashRunConvention) {

@@ -8,6 +8,7 @@
 
 #include "context/context.h"
 #include "platform/diagnostic_log.h"
+#include "platform/testing/log_capture.h"
 
 namespace tarvod {
 namespace {
@@ -21,13 +22,7 @@ constexpr const char* kFile = "/etc/tarvod.d/rules/a.plist";
 class LookupTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char pattern[] = "/tmp/tarvod-lookup-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern), nullptr);
-    dir_ = pattern;
-    log_ = dir_ + "/error.log";
-    const int fd = SafeOpen(log_.c_str(), 0600, O_WRONLY | O_APPEND);
-    ASSERT_GE(fd, 0);
-    AttachErrorLog(fd);
+    dir_ = capture_.directory();
     SetDebugLevel(0);
 
     variables_ = std::make_shared<VariableStore>(VariableStore{
@@ -50,21 +45,13 @@ class LookupTest : public ::testing::Test {
     context_->eventMetadata().set("auth.failure:lastEventTimestamp", Value::Real(0));
     SetDebugLevel(6);
   }
-  void TearDown() override {
-    CloseLogs();
-    std::system(("rm -rf " + dir_).c_str());
-  }
-  std::string Log() const {
-    std::ifstream in(log_);
-    std::ostringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
+  std::string Log() const { return capture_.text(); }
   const Value* Local(std::string_view name) {
     const Dictionary* file = variables_->findDictionary(kFile);
     return file ? file->find(name) : nullptr;
   }
-  std::string dir_, log_;
+  testing::LogCapture capture_;
+  std::string dir_;
   VariableStorePtr variables_;
   std::unique_ptr<Context> context_;
 };

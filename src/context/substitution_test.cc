@@ -8,6 +8,7 @@
 
 #include "context/context.h"
 #include "platform/diagnostic_log.h"
+#include "platform/testing/log_capture.h"
 
 namespace tarvod {
 namespace {
@@ -21,13 +22,7 @@ constexpr const char* kFile = "/etc/tarvod.d/rules/s.plist";
 class SubstitutionTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char pattern[] = "/tmp/tarvod-substitution-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern), nullptr);
-    dir_ = pattern;
-    log_ = dir_ + "/error.log";
-    const int fd = SafeOpen(log_.c_str(), 0600, O_WRONLY | O_APPEND);
-    ASSERT_GE(fd, 0);
-    AttachErrorLog(fd);
+    dir_ = capture_.directory();
     SetDebugLevel(6);
     variables_ = std::make_shared<VariableStore>(VariableStore{
         {kGlobalsKey, Dictionary{}},
@@ -41,17 +36,9 @@ class SubstitutionTest : public ::testing::Test {
     });
     context_ = std::make_unique<Context>(variables_, std::make_shared<Rulebase>());
   }
-  void TearDown() override {
-    CloseLogs();
-    std::system(("rm -rf " + dir_).c_str());
-  }
-  std::string Log() const {
-    std::ifstream in(log_);
-    std::ostringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
-  std::string dir_, log_;
+  std::string Log() const { return capture_.text(); }
+  testing::LogCapture capture_;
+  std::string dir_;
   VariableStorePtr variables_;
   std::unique_ptr<Context> context_;
 };

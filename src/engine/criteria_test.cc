@@ -10,6 +10,7 @@
 #include "engine/rule_processor.h"
 #include "platform/diagnostic_log.h"
 #include "platform/directory.h"
+#include "platform/testing/log_capture.h"
 
 namespace tarvod {
 namespace {
@@ -24,12 +25,7 @@ class CriteriaTest : public ::testing::Test {
  protected:
   void SetUp() override {
     BuildKeywordTables();
-    char pattern[] = "/tmp/tarvod-criteria-XXXXXX";
-    dir_ = mkdtemp(pattern);
-    log_ = dir_ + "/error.log";
-    const int fd = SafeOpen(log_.c_str(), 0600, O_WRONLY | O_APPEND);
-    ASSERT_GE(fd, 0);
-    AttachErrorLog(fd);
+    dir_ = capture_.directory();
     SetDebugLevel(2);
     auto store = std::make_shared<VariableStore>();
     store->set(kGlobalsKey, Dictionary{{"count", Value::Integer(5)}});
@@ -41,22 +37,13 @@ class CriteriaTest : public ::testing::Test {
     context_ = std::make_unique<Context>(store, std::make_shared<Rulebase>());
     rule_ = Dictionary{{"filePath", kRulesFile}};
   }
-  void TearDown() override {
-    CloseLogs();
-    SetDebugLevel(0);
-    std::system(("rm -rf " + dir_).c_str());
-  }
-  std::string Log() const {
-    std::ifstream in(log_);
-    std::ostringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
+  std::string Log() const { return capture_.text(); }
   bool Check(const char* op, Array operands) {
     return ProcessCriteria(Dictionary{{"operator", op}, {"operands", Value(std::move(operands))}},
                            rule_, *context_);
   }
-  std::string dir_, log_;
+  testing::LogCapture capture_;
+  std::string dir_;
   std::unique_ptr<Context> context_;
   Dictionary rule_;
 };

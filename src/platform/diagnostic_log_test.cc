@@ -1,11 +1,11 @@
 #include "platform/diagnostic_log.h"
 
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <gtest/gtest.h>
-
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <string>
@@ -35,7 +35,8 @@ class DiagnosticLogTest : public ::testing::Test {
   void TearDown() override {
     CloseLogs();
     SetDebugLevel(0);
-    std::system(("rm -rf " + dir_).c_str());
+    std::error_code ignored;
+    std::filesystem::remove_all(dir_, ignored);
   }
   std::string dir_, path_;
 };

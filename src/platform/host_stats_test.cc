@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <cstdlib>
+#include <filesystem>
 #include <fstream>
 
 namespace tarvod {
@@ -19,7 +20,8 @@ class HostStatsTest : public ::testing::Test {
   }
   void TearDown() override {
     SetMeminfoPathForTesting("");
-    std::system(("rm -rf " + dir_).c_str());
+    std::error_code ignored;
+    std::filesystem::remove_all(dir_, ignored);
   }
   void Write(const std::string& text) { std::ofstream(path_) << text; }
   std::string dir_, path_;

@@ -20,9 +20,8 @@ Bytes Cat(std::initializer_list<Bytes> parts) {
   return all;
 }
 Bytes Token(uint8_t id, Bytes body) {
-  Bytes t{id};
-  t.insert(t.end(), body.begin(), body.end());
-  return t;
+  body.insert(body.begin(), id);
+  return body;
 }
 Bytes Counted(int width, size_t n, uint8_t fill = 'x') {
   Bytes b;

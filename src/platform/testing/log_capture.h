@@ -1,0 +1,50 @@
+// Unit-test helper: points the error log at a fresh temporary file for the life of the object,
+// so a test can read back exactly what was logged. Test thread only.
+#pragma once
+
+#include <fcntl.h>
+#include <stdlib.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <string>
+
+#include "platform/diagnostic_log.h"
+
+namespace tarvod::testing {
+
+class LogCapture {
+ public:
+  explicit LogCapture(int64_t level = 6) {
+    char pattern[] = "/tmp/tarvod-log-XXXXXX";
+    if (mkdtemp(pattern)) mDirectory = pattern;
+    mPath = mDirectory + "/error.log";
+    const int fd = SafeOpen(mPath.c_str(), 0600, O_WRONLY | O_APPEND);
+    if (fd >= 0) AttachErrorLog(fd);
+    SetDebugLevel(level);
+  }
+  ~LogCapture() {
+    CloseLogs();
+    SetDebugLevel(0);
+    std::error_code ignored;
+    std::filesystem::remove_all(mDirectory, ignored);
+  }
+  LogCapture(const LogCapture&) = delete;
+  LogCapture& operator=(const LogCapture&) = delete;
+
+  const std::string& path() const { return mPath; }
+  const std::string& directory() const { return mDirectory; }
+  std::string text() const {
+    std::ifstream in(mPath, std::ios::binary);
+    std::ostringstream s;
+    s << in.rdbuf();
+    return s.str();
+  }
+
+ private:
+  std::string mDirectory = "/tmp";
+  std::string mPath;
+};
+
+}  // namespace tarvod::testing
