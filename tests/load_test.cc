@@ -47,7 +47,7 @@ TEST(Load, EveryEventOfEightConcurrentSendersIsCountedInBoundedMemory) {
                            String("log") + "<key>message</key>" + String("${event:n}") +
                            "<key>logPath</key>" + String(counted) + "</dict></array></dict>";
   const std::string rules = dir.write("rules.plist", PlistDocument("<array>" + rule + "</array>"));
-  Daemon daemon({"-c", config, "-r", rules, "-n"}, dir);
+  Daemon daemon({"-c", config, "-r", rules, "-n", "-v", "1"}, dir);
   ASSERT_TRUE(daemon.waitForLine(dir.file("error.log"), "Registered"));
 
   std::atomic<int> failures{0};

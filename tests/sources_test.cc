@@ -223,6 +223,7 @@ TEST_F(SourcesTest, AStaleSocketFromAnEarlierRunIsReplaced) {
   ASSERT_EQ(mDaemon->stop(SIGKILL), 128 + SIGKILL);  // leaves the socket file behind
   struct stat st;
   ASSERT_EQ(lstat(mSocketPath.c_str(), &st), 0);
+  std::filesystem::remove(errorLog());  // so the restart is awaited on its own lines
   startDaemon();
   ASSERT_TRUE(SendAs(0, 0, mSocketPath, EventMessage("t", "again")));
   EXPECT_TRUE(waitForEvent("again 0 0\n")) << log();
