@@ -145,7 +145,6 @@ int DaemonMain(int argc, char** argv) {
   // Step 9: saved state.
   if (options.restoreState) {
     LogMessage(1, "Restoring saved state");
-    // Step 9: restore state.
   }
 
   LogSecuritySession();
@@ -210,11 +209,17 @@ int DaemonMain(int argc, char** argv) {
   }
 
   PostShutdownEvent(rulebase, variables);
-  ProcessingQueue().drain();  // the shutdown rules run before the logs close
   // Stop the sources.
   monitor->stopListening();
+  // The shutdown rules, and those of every event the sources had already read, run before
+  // the logs close.
+  ProcessingQueue().drain();
   LogMessage(0, "Velkin Shutdown at %s", NowText().c_str());
   CloseLogs();
+  // Connections accepted earlier may still deliver until the input thread is gone; after it
+  // is joined and the last jobs have run, nothing else touches the daemon's objects at exit.
+  monitor.reset();
+  ProcessingQueue().drain();
   sd_event_source_unref(wakeSource);
   sd_event_unref(loop);
   return 0;
