@@ -1,6 +1,7 @@
 #include "platform/structured_log.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <sys/uio.h>
 #include <systemd/sd-journal.h>
 #include <unistd.h>
@@ -28,6 +29,8 @@ constexpr std::array<std::string_view, 20> kReservedFields = {
     "USER_UNIT",         "DOCUMENTATION",      "TID",
     "OBJECT_PID",        "COREDUMP_UNIT",
 };
+
+constexpr const char* kJournalSocket = "/run/systemd/journal/socket";
 
 // The journal takes field names of at most 64 characters.
 constexpr size_t kMaxFieldName = 64;
@@ -81,6 +84,10 @@ class JournalLog final : public StructuredLog {
       vectors[i].iov_base = fields[i].data();
       vectors[i].iov_len = fields[i].size();
     }
+    // sd_journal_sendv reports success when the journal's socket does not exist (it drops the
+    // record silently); a record that cannot reach the journal must count as failed.
+    struct stat st {};
+    if (stat(kJournalSocket, &st) != 0 || !S_ISSOCK(st.st_mode)) return false;
     // sd_journal_sendv is safe to call from several threads at once.
     return sd_journal_sendv(vectors.data(), static_cast<int>(vectors.size())) >= 0;
   }

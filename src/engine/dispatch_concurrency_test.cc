@@ -1,0 +1,70 @@
+// Events dispatched from two threads at once: their rules take turns on the processing queue.
+// Every rule run reads and rewrites the same global; were two rules ever to run at the same
+// time, updates would be lost and ThreadSanitizer (this test is THREADED) would report the
+// unsynchronised access to the variable store.
+
+#include <gtest/gtest.h>
+
+#include <thread>
+
+#include "engine/dispatch.h"
+#include "engine/keyword_tables.h"
+#include "platform/structured_log.h"
+#include "platform/testing/json_lines.h"
+#include "platform/testing/log_capture.h"
+
+namespace tarvod {
+namespace {
+
+using plist::Array;
+using plist::Dictionary;
+using plist::Value;
+
+RulePtr CountingRule(const char* name) {
+  return std::make_shared<const Rule>(Dictionary{
+      {"name", name},
+      {"filePath", "/rules/count.plist"},
+      {"criterion", Array{Value(Dictionary{{"operator", "true"}})}},
+      {"variables", Dictionary{{"global:count", "${global:count} + 1"}}},
+  });
+}
+
+TEST(DispatchConcurrency, EventsFromTwoThreadsNeverRunRulesAtTheSameTime) {
+  testing::LogCapture capture(0);
+  const std::string records = capture.directory() + "/records.jsonl";
+  ConfigureStructuredLog(records);
+  BuildKeywordTables();
+
+  auto variables = std::make_shared<VariableStore>();
+  variables->set(kGlobalsKey, Dictionary{{"count", Value::Integer(0)}});
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)["tick"].rules = {CountingRule("first"), CountingRule("second")};
+  (*rulebase)["tick.fast"].rules = {CountingRule("third")};
+
+  constexpr int kEventsPerThread = 150;
+  const auto sender = [&](const char* type) {
+    for (int i = 0; i < kEventsPerThread; ++i) {
+      DispatchEvent(rulebase, Dictionary{{"eventType", type}}, variables);
+    }
+  };
+  std::thread timer(sender, "tick");
+  std::thread input(sender, "tick.fast");
+  timer.join();
+  input.join();
+  ProcessingQueue().drain();
+
+  // tick runs two rules; tick.fast runs its own and then tick's two.
+  const int64_t expected = kEventsPerThread * 2 + kEventsPerThread * 3;
+  EXPECT_EQ(variables->findDictionary(kGlobalsKey)->find("count")->integerValue(), expected);
+  EXPECT_EQ((*rulebase)["tick"].eventCounter.load(), 2u * kEventsPerThread);
+  EXPECT_EQ((*rulebase)["tick.fast"].eventCounter.load(), 1u * kEventsPerThread);
+  // One record per tick event and two per tick.fast event, none blocked.
+  const auto written = testing::ReadJsonRecords(records);
+  EXPECT_EQ(written.size(), 3u * kEventsPerThread);
+  for (const auto& record : written) EXPECT_EQ(record.attribute("eventBlocked"), "false");
+  EXPECT_EQ(capture.text(), "");
+  ConfigureStructuredLog("");
+}
+
+}  // namespace
+}  // namespace tarvod
