@@ -1,0 +1,193 @@
+// The structured log through a real systemd-journald: the test moves itself into a private
+// mount namespace with empty tmpfs mounts over the journal's socket and storage directories,
+// starts its own journald there, runs the daemon (which inherits the namespace) and reads the
+// records back with journalctl. Needs root; skipped otherwise.
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <string>
+#include <vector>
+
+#include "harness.h"
+#include "rules_xml.h"
+
+namespace tarvod::testing {
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+constexpr const char* kJournald = "/lib/systemd/systemd-journald";
+constexpr const char* kSocket = "/run/systemd/journal/socket";
+
+// Empty journal directories, visible to this process and its children only.
+bool EnterPrivateJournalNamespace(std::string& why) {
+  static int state = 0;  // 0 not tried, 1 entered, -1 failed
+  static std::string failure;
+  if (state == 0) {
+    state = -1;
+    if (geteuid() != 0) {
+      failure = "needs root";
+    } else if (access(kJournald, X_OK) != 0) {
+      failure = "no systemd-journald";
+    } else if (unshare(CLONE_NEWNS) != 0) {
+      failure = "unshare failed";
+    } else if (mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
+      failure = "cannot make mounts private";
+    } else {
+      state = 1;
+      for (const char* dir : {"/run/systemd/journal", "/run/log/journal", "/var/log/journal"}) {
+        if (std::string(dir) != "/var/log/journal") {
+          mkdir("/run/systemd", 0755);
+          mkdir("/run/log", 0755);
+          mkdir(dir, 0755);
+        }
+        struct stat st {};
+        if (stat(dir, &st) == 0 && mount("tmpfs", dir, "tmpfs", 0, "mode=0755") != 0) {
+          failure = std::string("cannot mount tmpfs on ") + dir;
+          state = -1;
+        }
+      }
+    }
+  }
+  why = failure;
+  return state == 1;
+}
+
+class Journald {
+ public:
+  Journald() {
+    mPid = fork();
+    if (mPid == 0) {
+      const int null = open("/dev/null", O_RDWR);
+      dup2(null, 1);
+      dup2(null, 2);
+      execl(kJournald, kJournald, static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    for (int i = 0; i < 100 && access(kSocket, F_OK) != 0; ++i) usleep(50000);
+  }
+  ~Journald() {
+    if (mPid > 0) {
+      kill(mPid, SIGTERM);
+      waitpid(mPid, nullptr, 0);
+    }
+    unlink(kSocket);  // the next test starts without a journal unless it starts one
+  }
+  Journald(const Journald&) = delete;
+  Journald& operator=(const Journald&) = delete;
+  bool ready() const { return mPid > 0 && access(kSocket, F_OK) == 0; }
+
+ private:
+  pid_t mPid = -1;
+};
+
+// One line per tarvod record: its own fields (not the journal's "_" ones) as KEY=value,
+// sorted, separated by tabs.
+std::vector<std::string> TarvodRecords() {
+  const RunResult shown = RunProgram(
+      {"/bin/sh", "-c",
+       "journalctl --no-pager -o json SYSLOG_IDENTIFIER=tarvod | python3 -c '"
+       "import json,sys\n"
+       "for l in sys.stdin:\n"
+       " r = json.loads(l)\n"
+       " print(\"\\t\".join(k + \"=\" + str(v) for k, v in sorted(r.items()) if k[0] != \"_\"))'"});
+  std::vector<std::string> lines;
+  size_t start = 0;
+  for (size_t end; (end = shown.out.find('\n', start)) != std::string::npos; start = end + 1) {
+    lines.push_back("\t" + shown.out.substr(start, end - start) + "\t");
+  }
+  return lines;
+}
+
+class JournalTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::string why;
+    if (!EnterPrivateJournalNamespace(why)) GTEST_SKIP() << why;
+  }
+  // Runs the daemon (no structuredLogPath: the journal) until its startup rules ran.
+  std::string run(const std::vector<std::string>& rules) {
+    const std::string config =
+        dir.write("tarvod.plist", ConfigPlist({{"errorLogPath", Str(errorLog)},
+                                               {"eventSocketPath", Str(dir.file("evtq"))},
+                                               {"stateDirectory", Str(dir.path())}}));
+    const std::string rulesPath = dir.write("rules.plist", RulesDocument(rules));
+    Daemon daemon({"-c", config, "-r", rulesPath, "-v", "1", "-n"}, dir);
+    EXPECT_TRUE(daemon.waitForLine(errorLog, "EVENT RECEIVED: startup.load"));
+    EXPECT_EQ(daemon.stop(), 0);
+    return ReadFile(errorLog);
+  }
+
+  TempDir dir;
+  const std::string errorLog = dir.file("error.log");
+  const std::string out = dir.file("out.log");
+};
+
+TEST_F(JournalTest, EventRecordsAndKvlogMessagesReachTheJournalWithTheirAttributes) {
+  Journald journald;
+  ASSERT_TRUE(journald.ready());
+  const std::string message = "kv %s%n \"q\" 100%";
+  const std::string log = run({RuleXml(
+      "to journal", {"startup.load"},
+      {{"actions",
+        Arr({Dict({{"type", Str("log")},
+                   {"logType", Str("kvlog")},
+                   {"logLevel", Str("warning")},
+                   {"facility", Str("auth")},
+                   {"message", Str(message)},
+                   {"details", Dict({{"user", Str("root")}, {"message", Str("detail text")}})}}),
+             FileLog(message, out)})}})});
+  EXPECT_THAT(log, Not(HasSubstr("Failed to log event")));
+  EXPECT_EQ(ReadFile(out), message + "\n");
+
+  std::vector<std::string> records;
+  for (int i = 0; i < 50; ++i) {  // journald stores what it received a moment later
+    records = TarvodRecords();
+    if (records.size() >= 3) break;
+    usleep(100000);
+  }
+  std::string event, kv, shutdown;
+  for (const auto& r : records) {
+    if (r.find("\tEVENTTYPE=startup.load\t") != std::string::npos) event = r;
+    if (r.find("\tEVENTTYPE=shutdown\t") != std::string::npos) shutdown = r;
+    if (r.find("\tFACILITY=auth\t") != std::string::npos) kv = r;
+  }
+  for (const char* field :
+       {"\tPRIORITY=1\t", "\tEVENTSOURCE=tarvod\t", "\tHASRULES=true\t", "\tEVENTBLOCKED=false\t",
+        "\tLEVEL=Alert\t", "\tSYSLOG_IDENTIFIER=tarvod\t", "\tTIME=", "\tTIMENANOSEC="}) {
+    EXPECT_THAT(event, HasSubstr(field));
+  }
+  EXPECT_THAT(shutdown, HasSubstr("\tHASRULES=false\t"));
+  EXPECT_THAT(kv, HasSubstr("\tPRIORITY=4\t"));  // "warning"
+  EXPECT_THAT(kv, HasSubstr("\tMESSAGE=" + message + "\t"));
+  EXPECT_THAT(kv, HasSubstr("\tUSER=root\t"));
+  EXPECT_THAT(kv, HasSubstr("\tAMESSAGE=detail text\t"));  // never the record's own MESSAGE
+}
+
+TEST_F(JournalTest, AnUnreachableJournalCostsEachRecordAMessageAndNothingElse) {
+  ASSERT_NE(access(kSocket, F_OK), 0);
+  const std::string log =
+      run({RuleXml("still runs", {"startup"}, {{"actions", Arr({FileLog("ran", out)})}})});
+  EXPECT_EQ(ReadFile(out), "ran\n");
+  // One message per record: two for startup.load (its full type and "startup"), one for
+  // shutdown; the daemon runs on and shuts down normally.
+  const auto count = [&](const std::string& line) {
+    size_t n = 0;
+    for (size_t at = log.find(line); at != std::string::npos; at = log.find(line, at + 1)) ++n;
+    return n;
+  };
+  EXPECT_EQ(count("Failed to log event startup.load to KVLOG tarvod database\n"), 2u);
+  EXPECT_EQ(count("Failed to log event shutdown to KVLOG tarvod database\n"), 1u);
+  EXPECT_THAT(log, HasSubstr("Velkin Shutdown at"));
+}
+
+}  // namespace
+}  // namespace tarvod::testing
