@@ -81,11 +81,13 @@ void DispatchEvent(const RulebasePtr& rulebase, const plist::Dictionary& event,
   const std::string type = typeValue->textForm();
   LogMessage(1, "EVENT RECEIVED: %s", type.c_str());
 
-  // One copy of the event, shared by every record job of this dispatch.
-  auto shared = std::make_shared<const plist::Dictionary>(event);
+  // One copy of the event, made when a prefix first has rules and shared by every record job
+  // of this dispatch.
+  std::shared_ptr<const plist::Dictionary> shared;
   for (const std::string& prefix : TypePrefixes(type)) {
     auto found = rulebase ? rulebase->find(prefix) : Rulebase::iterator();
     if (rulebase && found != rulebase->end()) {
+      if (!shared) shared = std::make_shared<const plist::Dictionary>(event);
       QueuePrefix(prefix, found->second, shared, rulebase, variables);
       continue;
     }

@@ -66,5 +66,40 @@ TEST(DispatchConcurrency, EventsFromTwoThreadsNeverRunRulesAtTheSameTime) {
   ConfigureStructuredLog("");
 }
 
+TEST(Dispatch, AnEventWithoutTypeLeavesNoTrace) {
+  testing::LogCapture capture(6);
+  const std::string records = capture.directory() + "/records.jsonl";
+  ConfigureStructuredLog(records);
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)[""].rules = {CountingRule("empty type")};
+  DispatchEvent(rulebase, Dictionary{{"eventDetails", Dictionary{{"a", "b"}}}},
+                std::make_shared<VariableStore>());
+  ProcessingQueue().drain();
+  EXPECT_EQ(capture.text(), "");
+  EXPECT_TRUE(testing::ReadJsonRecords(records).empty());
+  ConfigureStructuredLog("");
+}
+
+TEST(Dispatch, EmptyComponentsOfATypeArePrefixesToo) {
+  testing::LogCapture capture(2);
+  const std::string records = capture.directory() + "/records.jsonl";
+  ConfigureStructuredLog(records);
+  auto variables = std::make_shared<VariableStore>();
+  variables->set(kGlobalsKey, Dictionary{{"count", Value::Integer(0)}});
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)["a."].rules = {CountingRule("a dot")};
+  DispatchEvent(rulebase, Dictionary{{"eventType", "a..b"}}, variables);
+  ProcessingQueue().drain();
+  EXPECT_EQ(variables->findDictionary(kGlobalsKey)->find("count")->integerValue(), 1);
+  const std::string log = capture.text();
+  EXPECT_NE(log.find("  Dropping event a..b because it has no associated rules\n"
+                     "  Processing event: a.\n"
+                     "  Dropping event a because it has no associated rules\n"),
+            std::string::npos)
+      << log;
+  EXPECT_EQ(testing::ReadJsonRecords(records).size(), 2u);
+  ConfigureStructuredLog("");
+}
+
 }  // namespace
 }  // namespace tarvod
