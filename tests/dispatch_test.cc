@@ -1,6 +1,8 @@
 // Rules run end to end in the real daemon: prefix order, records, the event counter, the three
 // criterion modes, variables, action dispatch and the file log action. The daemon's own
-// "startup.load" event (and events sent through the event socket) drive the rules.
+// "startup.load" event (and events sent through the event socket) drive the rules. Tests that
+// read runs of consecutive log lines use the "shutdown" event: while startup's rules run, the
+// main thread is still writing its own lines between theirs.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
@@ -154,20 +156,20 @@ TEST_F(DispatchTest, EvaluatesCriteriaInAnyAllAndUnconditionalModes) {
   const std::string fail2 = Criterion("equal", {Int(3), Int(4)});
   const std::string pass = Criterion("true");
   const std::string log =
-      run({RuleXml("any", {"startup.load"},
+      run({RuleXml("any", {"shutdown"},
                    {{"allowPartialCriterionMatch", Bool(true)},
                     {"criterion", Arr({fail1, pass, fail2})},
                     {"actions", Arr({FileLog("any fired", out)})}}),
-           RuleXml("all", {"startup.load"},
+           RuleXml("all", {"shutdown"},
                    {{"criterion", Arr({pass, fail1, pass})},
                     {"actions", Arr({FileLog("all fired", out)})}}),
-           RuleXml("none", {"startup.load"}, {{"actions", Arr({FileLog("none fired", out)})}}),
-           RuleXml("any failing", {"startup.load"},
+           RuleXml("none", {"shutdown"}, {{"actions", Arr({FileLog("none fired", out)})}}),
+           RuleXml("any failing", {"shutdown"},
                    {{"allowPartialCriterionMatch", Bool(true)},
                     {"criterion", Arr({fail1, fail2})},
                     {"actions", Arr({FileLog("any failing fired", out)})}}),
            // Only the boolean true selects "any"; the text "true" does not.
-           RuleXml("text true", {"startup.load"},
+           RuleXml("text true", {"shutdown"},
                    {{"allowPartialCriterionMatch", Str("true")},
                     {"criterion", Arr({pass, fail1})},
                     {"actions", Arr({FileLog("text true fired", out)})}})},
@@ -199,7 +201,7 @@ TEST_F(DispatchTest, AssignsFileVariablesThenRuleVariablesInKeyOrderBeforeTheAct
       dir.write("vars.plist", PlistDocument(Dict({{"b", Str("file b")}, {"a", Str("file a")}})));
   const std::string missing = dir.file("missing.plist");
   const std::string log =
-      run({RuleXml("vars", {"startup.load"},
+      run({RuleXml("vars", {"shutdown"},
                    {{"loadVariablesFromFile", Str(variablesFile)},
                     // n2 sorts after n1 and sees its new value; c sees the rule's b.
                     {"variables", Dict({{"n2", Str("${n1} + 1")},
@@ -207,7 +209,7 @@ TEST_F(DispatchTest, AssignsFileVariablesThenRuleVariablesInKeyOrderBeforeTheAct
                                         {"b", Str("rule b")},
                                         {"n1", Int(1)}})},
                     {"actions", Arr({FileLog("${a}|${b}|${c}|${n2}", out)})}}),
-           RuleXml("missing file", {"startup.load"},
+           RuleXml("missing file", {"shutdown"},
                    {{"loadVariablesFromFile", Str(missing)},
                     {"actions", Arr({FileLog("still ran", out)})}})},
           4);
@@ -228,7 +230,7 @@ TEST_F(DispatchTest, DispatchesActionsByKeywordAndDumpsOnlyForExactData) {
     return Dict({{"type", Str(type)}, {"data", Str(data)}});
   };
   const std::string log =
-      run({RuleXml("dump", {"startup.load"},
+      run({RuleXml("dump", {"shutdown"},
                    {{"variables", Dict({{"global:marker", Str("m1")}})},
                     {"actions", Arr({dump("debugdump", "all"), dump("debugdump", "globals"),
                                      dump("debugdump", "rulebase"), dump("DebugDump", "All"),
