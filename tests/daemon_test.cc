@@ -1,10 +1,9 @@
 // The daemon's start and stop: command line, configuration, logs and rule loading, observed
 // through the real binary's exit status and error log.
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include "harness.h"
 
@@ -18,9 +17,8 @@ std::string String(std::string_view s) { return "<string>" + std::string(s) + "<
 
 std::string RuleXml(std::string_view name, std::string_view eventTypesXml,
                     std::string_view extra = {}) {
-  return "<dict><key>name</key><string>" + std::string(name) +
-         "</string><key>eventTypes</key>" + std::string(eventTypesXml) + std::string(extra) +
-         "</dict>";
+  return "<dict><key>name</key><string>" + std::string(name) + "</string><key>eventTypes</key>" +
+         std::string(eventTypesXml) + std::string(extra) + "</dict>";
 }
 
 std::string RulesFile(const std::vector<std::string>& rules) {
@@ -84,12 +82,13 @@ TEST_F(DaemonTest, DebugLevelComesFromTheCommandLineUnlessItIsZero) {
     bool expectLevel1;
     bool expectLevel4;
   };
-  for (const Case& c : {Case{"0", "", false, false}, Case{"0", "1", true, false},
-                        Case{"3", "1", true, false}, Case{"4", "", true, true},
-                        Case{" +4x", "", true, true}, Case{"-1", "6", false, false}}) {
+  for (const Case& c :
+       {Case{"0", "", false, false}, Case{"0", "1", true, false}, Case{"3", "1", true, false},
+        Case{"4", "", true, true}, Case{" +4x", "", true, true}, Case{"-1", "6", false, false}}) {
     std::remove(errorLog().c_str());
     std::vector<std::pair<std::string, std::string>> extra;
-    if (!c.configured.empty()) extra.emplace_back("debugLevel", "<integer>" + c.configured + "</integer>");
+    if (!c.configured.empty())
+      extra.emplace_back("debugLevel", "<integer>" + c.configured + "</integer>");
     const std::string config = writeConfig(extra);
     ASSERT_EQ(run({"-c", config, "-r", rules, "-v", c.option}).status, 0);
     const std::string log = ReadFile(errorLog());
@@ -136,8 +135,8 @@ TEST_F(DaemonTest, SymbolicLinkAtTheErrorLogPathIsRefusedAndHardLinkAccepted) {
 
 TEST_F(DaemonTest, LongMessagesAreCutTo2047BytesAndOneNewline) {
   const std::string longName(3000, 'n');
-  const std::string rules = dir.write(
-      "rules.plist", RulesFile({RuleXml(longName, "<array><string>x</string></array>")}));
+  const std::string rules =
+      dir.write("rules.plist", RulesFile({RuleXml(longName, "<array><string>x</string></array>")}));
   const std::string config = writeConfig({{"debugLevel", "<integer>3</integer>"}});
   Daemon daemon({"-c", config, "-r", rules}, dir);
   ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
@@ -216,8 +215,8 @@ class VelkinDirectoryTest : public DaemonTest {
     const std::string script = "mount -t tmpfs tmpfs /var/log || exit 99; umask 022; " + setup +
                                "; '" + TarvodBinary() + "' -c '" + config + "' -r '" +
                                dir.file("missing") + "'; echo status=$?; " + probe;
-    return RunProgram({"/usr/bin/unshare", "-m", "--propagation", "private", "/bin/sh", "-c",
-                       script});
+    return RunProgram(
+        {"/usr/bin/unshare", "-m", "--propagation", "private", "/bin/sh", "-c", script});
   }
 };
 
@@ -229,7 +228,8 @@ TEST_F(VelkinDirectoryTest, MissingDirectoryIsCreated) {
 }
 
 TEST_F(VelkinDirectoryTest, RegularFileOrLinkInItsPlaceFailsStartup) {
-  for (const std::string setup : {"touch /var/log/velkin", "mkdir /var/log/real; ln -s /var/log/real /var/log/velkin"}) {
+  for (const std::string setup :
+       {"touch /var/log/velkin", "mkdir /var/log/real; ln -s /var/log/real /var/log/velkin"}) {
     const RunResult r = runInNamespace(setup, "true");
     if (r.status == 99 || r.status == 127) GTEST_SKIP() << "no mount namespace here: " << r.err;
     EXPECT_THAT(r.out, HasSubstr("status=255"));

@@ -21,8 +21,15 @@ constexpr int kSenders = 8;
 constexpr int kEventsPerSender = 25'000;
 // The daemon's peak resident memory must stay below this. An unbounded queue of 200,000
 // parsed events and their rule jobs would take several hundred MiB; the bounded pipeline
-// needs a small fraction of it.
-constexpr long kResidentBoundKb = 96 * 1024;
+// needs a small fraction of it (about 8 MiB here).
+constexpr long kResidentBoundKb = 32 * 1024;
+// Sanitizer runtimes keep freed memory in quarantine and shadow every byte, so only the
+// plain build measures the daemon's own memory.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kMeasuresOwnMemory = false;
+#else
+constexpr bool kMeasuresOwnMemory = true;
+#endif
 
 std::string String(std::string_view s) { return "<string>" + std::string(s) + "</string>"; }
 
@@ -96,7 +103,9 @@ TEST(Load, EveryEventOfEightConcurrentSendersIsCountedInBoundedMemory) {
   EXPECT_EQ(CountLines(counted), expected);
   std::printf("daemon peak resident memory: %ld kB (sampled %ld kB), bound %ld kB\n", hwm,
               peakKb.load(), kResidentBoundKb);
-  EXPECT_LT(std::max(hwm, peakKb.load()), kResidentBoundKb);
+  if (kMeasuresOwnMemory) {
+    EXPECT_LT(std::max(hwm, peakKb.load()), kResidentBoundKb);
+  }
   EXPECT_EQ(daemon.stop(), 0);
 }
 
