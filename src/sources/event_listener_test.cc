@@ -48,6 +48,9 @@ class EventSocketTest : public ::testing::Test {
   std::string mDirectory;
   std::string mPath;
   EventCollector mCollector;
+  // The processing backlog a test pretends; declared before the monitor that polls it, so it
+  // outlives the monitor.
+  std::atomic<size_t> mBacklog{0};
   std::unique_ptr<Monitor> mMonitor;
 };
 
@@ -185,15 +188,15 @@ TEST_F(EventSocketTest, ConnectionsBeyondTheLimitWaitUntilOneCloses) {
 }
 
 TEST_F(EventSocketTest, ReadingStopsWhileTheProcessingBacklogIsOverItsLimit) {
-  std::atomic<size_t> backlog{kBackPressureHighJobs + 1};
-  start(&backlog);
+  mBacklog = kBackPressureHighJobs + 1;
+  start(&mBacklog);
   Client client(mPath);
   ASSERT_TRUE(client.send(EventXml("first")));
   ASSERT_TRUE(mCollector.waitFor(1));
   ASSERT_TRUE(client.send(EventXml("held")));
   settle();
   EXPECT_EQ(mCollector.size(), 1u) << "nothing is read while the backlog is high";
-  backlog = kBackPressureLowJobs;
+  mBacklog = kBackPressureLowJobs;
   ASSERT_TRUE(mCollector.waitFor(2));
   EXPECT_EQ(*mCollector.events()[1].findString("eventType"), "held");
 }
