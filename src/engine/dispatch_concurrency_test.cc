@@ -92,10 +92,9 @@ TEST(Dispatch, EmptyComponentsOfATypeArePrefixesToo) {
   ProcessingQueue().drain();
   EXPECT_EQ(variables->findDictionary(kGlobalsKey)->find("count")->integerValue(), 1);
   const std::string log = capture.text();
-  EXPECT_NE(log.find("  Dropping event a..b because it has no associated rules\n"
-                     "  Processing event: a.\n"
-                     "  Dropping event a because it has no associated rules\n"),
-            std::string::npos)
+  EXPECT_TRUE(testing::LinesInOrder(
+      log, {"  Dropping event a..b because it has no associated rules\n",
+            "  Processing event: a.\n", "  Dropping event a because it has no associated rules\n"}))
       << log;
   EXPECT_EQ(testing::ReadJsonRecords(records).size(), 2u);
   ConfigureStructuredLog("");

@@ -7,8 +7,10 @@
 
 #include <filesystem>
 #include <fstream>
+#include <initializer_list>
 #include <sstream>
 #include <string>
+#include <string_view>
 
 #include "platform/diagnostic_log.h"
 
@@ -46,5 +48,17 @@ class LogCapture {
   std::string mDirectory = "/tmp";
   std::string mPath;
 };
+
+// True when each line appears in text after the one before it. Lines logged by one thread
+// keep their order, but another thread may write between them.
+inline bool LinesInOrder(const std::string& text, std::initializer_list<std::string_view> lines) {
+  size_t from = 0;
+  for (std::string_view line : lines) {
+    const size_t found = text.find(line, from);
+    if (found == std::string::npos) return false;
+    from = found + line.size();
+  }
+  return true;
+}
 
 }  // namespace tarvod::testing
