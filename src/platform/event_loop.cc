@@ -124,8 +124,11 @@ bool EventLoop::callLater(uint64_t delayMicroseconds, std::function<void()> job)
   if (mEvent == nullptr) return false;
   auto* stored = new std::function<void()>(std::move(job));
   sd_event_source* source = nullptr;
-  if (sd_event_add_time_relative(mEvent, &source, CLOCK_MONOTONIC, delayMicroseconds, 0, OnTimer,
-                                 stored) < 0) {
+  // An accuracy of 0 would mean sd-event's default of 250 ms, far coarser than the short
+  // delays asked for here (the back-pressure poll): ask for microseconds.
+  constexpr uint64_t kAccuracyMicroseconds = 1;
+  if (sd_event_add_time_relative(mEvent, &source, CLOCK_MONOTONIC, delayMicroseconds,
+                                 kAccuracyMicroseconds, OnTimer, stored) < 0) {
     delete stored;
     return false;
   }
