@@ -15,44 +15,47 @@ constexpr size_t kInitialBuffer = 4096;
 constexpr size_t kMaxBuffer = 8 * 1024 * 1024;
 constexpr int kMaxGroups = 65536;
 
+// Calls a reentrant getpwnam_r/getgrnam_r-style function, growing the buffer while the entry
+// does not fit. Returns the entry, or nullptr when there is none or the look-up failed.
+template <typename Entry, typename Function>
+Entry* LookUpEntry(Function function, const std::string& name, Entry& entry,
+                   std::vector<char>& buffer) {
+  buffer.resize(kInitialBuffer);
+  for (;;) {
+    Entry* found = nullptr;
+    const int error = function(name.c_str(), &entry, buffer.data(), buffer.size(), &found);
+    if (error == ERANGE && buffer.size() < kMaxBuffer) {
+      buffer.resize(buffer.size() * 2);
+      continue;
+    }
+    return error == 0 ? found : nullptr;
+  }
+}
+
 }  // namespace
 
 std::optional<UserRecord> LookUpUser(const std::string& name) {
   if (name.empty()) return std::nullopt;
-  std::vector<char> buffer(kInitialBuffer);
-  while (true) {
-    struct passwd entry {};
-    struct passwd* found = nullptr;
-    const int error = getpwnam_r(name.c_str(), &entry, buffer.data(), buffer.size(), &found);
-    if (error == ERANGE && buffer.size() < kMaxBuffer) {
-      buffer.resize(buffer.size() * 2);
-      continue;
-    }
-    if (error != 0 || found == nullptr) return std::nullopt;
-    UserRecord user;
-    user.name = found->pw_name ? found->pw_name : name;
-    user.uid = found->pw_uid;
-    user.gid = found->pw_gid;
-    user.home = found->pw_dir ? found->pw_dir : "";
-    user.shell = found->pw_shell ? found->pw_shell : "";
-    return user;
-  }
+  struct passwd entry {};
+  std::vector<char> buffer;
+  const struct passwd* found = LookUpEntry(getpwnam_r, name, entry, buffer);
+  if (found == nullptr) return std::nullopt;
+  UserRecord user;
+  user.name = found->pw_name ? found->pw_name : name;
+  user.uid = found->pw_uid;
+  user.gid = found->pw_gid;
+  user.home = found->pw_dir ? found->pw_dir : "";
+  user.shell = found->pw_shell ? found->pw_shell : "";
+  return user;
 }
 
 std::optional<gid_t> LookUpGroupID(const std::string& name) {
   if (name.empty()) return std::nullopt;
-  std::vector<char> buffer(kInitialBuffer);
-  while (true) {
-    struct group entry {};
-    struct group* found = nullptr;
-    const int error = getgrnam_r(name.c_str(), &entry, buffer.data(), buffer.size(), &found);
-    if (error == ERANGE && buffer.size() < kMaxBuffer) {
-      buffer.resize(buffer.size() * 2);
-      continue;
-    }
-    if (error != 0 || found == nullptr) return std::nullopt;
-    return found->gr_gid;
-  }
+  struct group entry {};
+  std::vector<char> buffer;
+  const struct group* found = LookUpEntry(getgrnam_r, name, entry, buffer);
+  if (found == nullptr) return std::nullopt;
+  return found->gr_gid;
 }
 
 std::vector<gid_t> GroupsOfUser(const UserRecord& user) {
