@@ -15,13 +15,6 @@
 namespace tarvod {
 namespace {
 
-std::string ReadAll(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::ostringstream s;
-  s << in.rdbuf();
-  return s.str();
-}
-
 void WriteAll(const std::string& path, const std::string& text) {
   std::ofstream(path, std::ios::binary) << text;
 }
@@ -61,7 +54,7 @@ TEST_F(LogActionTest, AppendsTheMessageAndOneNewlineToTheFileByteForByte) {
   WriteAll(path, "existing\n");
   Run(Dictionary{{"message", "nine char"}, {"logPath", path}});
   Run(Dictionary{{"message", "two\nlines ${global:who} 100%s%n \\:"}, {"logPath", path}});
-  EXPECT_EQ(ReadAll(path), "existing\nnine char\ntwo\nlines root 100%s%n :\n");
+  EXPECT_EQ(testing::ReadWholeFile(path), "existing\nnine char\ntwo\nlines root 100%s%n :\n");
 }
 
 TEST_F(LogActionTest, CreatesAMissingFileWithMode0644) {
@@ -71,7 +64,7 @@ TEST_F(LogActionTest, CreatesAMissingFileWithMode0644) {
   struct stat st {};
   ASSERT_EQ(stat((dir_ + "/v.log").c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0644u);
-  EXPECT_EQ(ReadAll(dir_ + "/v.log"), "m\n");
+  EXPECT_EQ(testing::ReadWholeFile(dir_ + "/v.log"), "m\n");
 }
 
 TEST_F(LogActionTest, DoesNothingForAnAbsentOrEmptyMessage) {
@@ -96,7 +89,7 @@ TEST_F(LogActionTest, SelectsTheStructuredLogByLogTypeInAnyCase) {
     Run(Dictionary{{"message", "m"}, {"logType", type}, {"logPath", dir_ + "/f.log"}});
     EXPECT_EQ(Records().size(), before + (structured ? 1 : 0)) << type;
   }
-  EXPECT_EQ(ReadAll(dir_ + "/f.log"), "m\nm\n");
+  EXPECT_EQ(testing::ReadWholeFile(dir_ + "/f.log"), "m\nm\n");
 }
 
 struct LevelCase {

@@ -12,15 +12,10 @@
 #include <thread>
 #include <vector>
 
+#include "platform/testing/log_capture.h"
+
 namespace tarvod {
 namespace {
-
-std::string Slurp(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::ostringstream s;
-  s << in.rdbuf();
-  return s.str();
-}
 
 class DiagnosticLogTest : public ::testing::Test {
  protected:
@@ -46,13 +41,13 @@ TEST_F(DiagnosticLogTest, WritesOnlyLevelsUpToTheDebugLevel) {
   for (int level = 0; level <= 6; ++level) LogMessage(level, "level %d", level);
   SetDebugLevel(-1);
   LogMessage(0, "never");
-  EXPECT_EQ(Slurp(path_), "level 0\nlevel 1\nlevel 2\nlevel 3\n");
+  EXPECT_EQ(testing::ReadWholeFile(path_), "level 0\nlevel 1\nlevel 2\nlevel 3\n");
 }
 
 TEST_F(DiagnosticLogTest, CutsLongMessagesAndAlwaysAddsOneNewline) {
   LogMessage(0, "%s", std::string(3000, 'x').c_str());
   LogMessage(0, "Loaded %d rules\n", 2);
-  EXPECT_EQ(Slurp(path_), std::string(2047, 'x') + "\nLoaded 2 rules\n\n");
+  EXPECT_EQ(testing::ReadWholeFile(path_), std::string(2047, 'x') + "\nLoaded 2 rules\n\n");
 }
 
 TEST_F(DiagnosticLogTest, LinesFromConcurrentWritersNeverInterleave) {
@@ -63,7 +58,7 @@ TEST_F(DiagnosticLogTest, LinesFromConcurrentWritersNeverInterleave) {
     });
   }
   for (auto& w : writers) w.join();
-  std::istringstream lines(Slurp(path_));
+  std::istringstream lines(testing::ReadWholeFile(path_));
   std::string line;
   int count = 0;
   while (std::getline(lines, line)) {
@@ -78,7 +73,7 @@ TEST_F(DiagnosticLogTest, NothingIsWrittenAfterTheLogsAreClosed) {
   LogMessage(0, "before");
   CloseLogs();
   LogMessage(0, "after");
-  EXPECT_EQ(Slurp(path_), "before\n");
+  EXPECT_EQ(testing::ReadWholeFile(path_), "before\n");
 }
 
 TEST_F(DiagnosticLogTest, SafeOpenRefusesLinksAndAcceptsHardLinks) {

@@ -16,6 +16,14 @@
 
 namespace tarvod::testing {
 
+// The whole content of a file; empty when it cannot be read.
+inline std::string ReadWholeFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::ostringstream s;
+  s << in.rdbuf();
+  return s.str();
+}
+
 class LogCapture {
  public:
   explicit LogCapture(int64_t level = 6) {
@@ -37,12 +45,7 @@ class LogCapture {
 
   const std::string& path() const { return mPath; }
   const std::string& directory() const { return mDirectory; }
-  std::string text() const {
-    std::ifstream in(mPath, std::ios::binary);
-    std::ostringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
+  std::string text() const { return ReadWholeFile(mPath); }
 
  private:
   std::string mDirectory = "/tmp";
