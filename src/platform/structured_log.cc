@@ -3,6 +3,8 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/uio.h>
+
+#include "plist/value.h"
 // The records carry the daemon's own fields only, not the source location of this file.
 #define SD_JOURNAL_SUPPRESS_LOCATION
 #include <systemd/sd-journal.h>
@@ -37,39 +39,6 @@ constexpr const char* kJournalSocket = "/run/systemd/journal/socket";
 // The journal takes field names of at most 64 characters.
 constexpr size_t kMaxFieldName = 64;
 
-void AppendJsonString(std::string& out, std::string_view text) {
-  out += '"';
-  for (const char c : text) {
-    const auto u = static_cast<unsigned char>(c);
-    switch (c) {
-      case '"':
-        out += "\\\"";
-        break;
-      case '\\':
-        out += "\\\\";
-        break;
-      case '\n':
-        out += "\\n";
-        break;
-      case '\r':
-        out += "\\r";
-        break;
-      case '\t':
-        out += "\\t";
-        break;
-      default:
-        if (u < 0x20 || u == 0x7f) {
-          char escaped[8];
-          std::snprintf(escaped, sizeof escaped, "\\u%04x", u);
-          out += escaped;
-        } else {
-          out += c;  // strings are valid UTF-8 by the time they reach a record
-        }
-    }
-  }
-  out += '"';
-}
-
 class JournalLog final : public StructuredLog {
  public:
   bool send(int priority, std::string_view message, const LogAttributes& attributes) override {
@@ -102,15 +71,15 @@ class JsonLinesLog final : public StructuredLog {
   bool send(int priority, std::string_view message, const LogAttributes& attributes) override {
     std::string line = "{\"identifier\": \"tarvod\", \"priority\": " + std::to_string(priority) +
                        ", \"message\": ";
-    AppendJsonString(line, message);
+    plist::AppendEscapedString(line, message);
     line += ", \"attributes\": {";
     bool first = true;
     for (const auto& [name, value] : attributes) {
       if (!first) line += ", ";
       first = false;
-      AppendJsonString(line, name);
+      plist::AppendEscapedString(line, name);
       line += ": ";
-      AppendJsonString(line, value);
+      plist::AppendEscapedString(line, value);
     }
     line += "}}\n";
 

@@ -170,6 +170,11 @@ class Dictionary {
 std::string Describe(const Value& value);
 std::string Describe(const Dictionary& dictionary);
 
+// Appends text between double quotes, escaping '"', '\\', line feed, tab and carriage return
+// with a backslash and other control characters as \u00XX: a form that both the old-style
+// text reader and JSON read back.
+void AppendEscapedString(std::string& out, std::string_view text);
+
 // Formats a date as "YYYY-MM-DD HH:MM:SS +HHMM" in the given zone (local time when true).
 std::string FormatDate(Date date, bool localTime);
 // Reads a date back from FormatDate's form ("YYYY-MM-DD HH:MM:SS +HHMM", any zone offset) or

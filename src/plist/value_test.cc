@@ -28,7 +28,7 @@ TEST(Describe, WritesEachKindInTheOldStyleForm) {
       {Value("-5"), "\"-5\""},
       {Value("//x"), "\"//x\""},
       {Value("two words"), "\"two words\""},
-      {Value("q\"b\\n\nt\tc\x01"), "\"q\\\"b\\\\n\\nt\\tc\\U0001\""},
+      {Value("q\"b\\n\nt\tc\x01"), "\"q\\\"b\\\\n\\nt\\tc\\u0001\""},
       {Value::Integer(-42), "-42"},
       {Value::Real(3), "3.0"},
       {Value::Real(0.1), "0.1"},
