@@ -141,7 +141,9 @@ void Context::setVariableValue(const std::optional<plist::Value>& value, std::st
       LogMessage(0, "Error: %s", error->description.c_str());
       return;
     }
-    LogMessage(4, "after resolveVarsInString value = %s", TextOrNull(stored).c_str());
+    if (DebugLevel() >= 4) {
+      LogMessage(4, "after resolveVarsInString value = %s", TextOrNull(stored).c_str());
+    }
     // Purely arithmetic text becomes its number; the character test keeps ordinary text away
     // from the evaluator.
     if (stored && stored->isString() && IsArithmeticCandidate(stored->string())) {
