@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include "harness.h"
+#include "rules_xml.h"
 
 namespace tarvod::testing {
 namespace {
@@ -13,30 +14,22 @@ namespace {
 using ::testing::HasSubstr;
 using ::testing::Not;
 
-std::string String(std::string_view s) { return "<string>" + std::string(s) + "</string>"; }
-
 std::string RuleXml(std::string_view name, std::string_view eventTypesXml,
                     std::string_view extra = {}) {
   return "<dict><key>name</key><string>" + std::string(name) + "</string><key>eventTypes</key>" +
          std::string(eventTypesXml) + std::string(extra) + "</dict>";
 }
 
-std::string RulesFile(const std::vector<std::string>& rules) {
-  std::string body = "<array>";
-  for (const auto& r : rules) body += r;
-  return PlistDocument(body + "</array>");
-}
-
 class DaemonTest : public ::testing::Test {
  protected:
   std::string errorLog() const { return dir.file("error.log"); }
   std::string writeConfig(std::vector<std::pair<std::string, std::string>> extra = {}) const {
-    extra.insert(extra.begin(), {"errorLogPath", String(errorLog())});
+    extra.insert(extra.begin(), {"errorLogPath", Str(errorLog())});
     return dir.write("tarvod.plist", ConfigPlist(extra));
   }
   std::string writeOneRule() const {
     return dir.write("rules/a.plist",
-                     RulesFile({RuleXml("first", "<array><string>x.y</string></array>")}));
+                     RulesDocument({RuleXml("first", "<array><string>x.y</string></array>")}));
   }
   RunResult run(const std::vector<std::string>& args) const {
     std::vector<std::string> argv{TarvodBinary()};
@@ -135,8 +128,8 @@ TEST_F(DaemonTest, SymbolicLinkAtTheErrorLogPathIsRefusedAndHardLinkAccepted) {
 
 TEST_F(DaemonTest, LongMessagesAreCutTo2047BytesAndOneNewline) {
   const std::string longName(3000, 'n');
-  const std::string rules =
-      dir.write("rules.plist", RulesFile({RuleXml(longName, "<array><string>x</string></array>")}));
+  const std::string rules = dir.write(
+      "rules.plist", RulesDocument({RuleXml(longName, "<array><string>x</string></array>")}));
   const std::string config = writeConfig({{"debugLevel", "<integer>3</integer>"}});
   Daemon daemon({"-c", config, "-r", rules}, dir);
   ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
@@ -148,18 +141,19 @@ TEST_F(DaemonTest, LongMessagesAreCutTo2047BytesAndOneNewline) {
 
 TEST_F(DaemonTest, RulesTreeLoadsEveryRulesFileAtAnyDepth) {
   const std::string types = "<array><string>a.b</string></array>";
-  dir.write("tree/one.plist", RulesFile({RuleXml("one", types)}));
-  dir.write("tree/nested/deeper/two.plist",
-            RulesFile({RuleXml("two", "<array><string>a.b</string><string>c</string></array>")}));
-  dir.write("tree/.hidden/three.plist", RulesFile({RuleXml("three", types)}));
-  dir.write("tree/.four.plist", RulesFile({RuleXml("four", types)}));
+  dir.write("tree/one.plist", RulesDocument({RuleXml("one", types)}));
+  dir.write(
+      "tree/nested/deeper/two.plist",
+      RulesDocument({RuleXml("two", "<array><string>a.b</string><string>c</string></array>")}));
+  dir.write("tree/.hidden/three.plist", RulesDocument({RuleXml("three", types)}));
+  dir.write("tree/.four.plist", RulesDocument({RuleXml("four", types)}));
   dir.write("tree/notes.txt", "not a property list");
   dir.write("tree/dict.plist", PlistDocument("<dict><key>name</key><string>x</string></dict>"));
   dir.write("tree/mixed.plist",
-            RulesFile({RuleXml("disabled", types, "<key>enabled</key><false/>"),
-                       RuleXml("stringTypes", "<string>a.b</string>"), "<string>junk</string>",
-                       RuleXml("twice", "<array><string>d</string><string>d</string></array>"),
-                       RuleXml("none", "<array/>")}));
+            RulesDocument({RuleXml("disabled", types, "<key>enabled</key><false/>"),
+                           RuleXml("stringTypes", "<string>a.b</string>"), "<string>junk</string>",
+                           RuleXml("twice", "<array><string>d</string><string>d</string></array>"),
+                           RuleXml("none", "<array/>")}));
   const std::string config = writeConfig({{"debugLevel", "<integer>3</integer>"}});
   Daemon daemon({"-c", config, "-r", dir.file("tree")}, dir);
   ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
@@ -188,7 +182,7 @@ TEST_F(DaemonTest, SingleRulesFileIsChosenByItsExtension) {
 
   // A directory whose name has an extension is read as a single file: no rules.
   mkdir(dir.file("my.rules").c_str(), 0755);
-  dir.write("my.rules/a.plist", RulesFile({RuleXml("r", "<array><string>x</string></array>")}));
+  dir.write("my.rules/a.plist", RulesDocument({RuleXml("r", "<array><string>x</string></array>")}));
   EXPECT_EQ(run({"-c", config, "-r", dir.file("my.rules")}).status, 0);
   EXPECT_THAT(ReadFile(errorLog()), HasSubstr("No rules found in " + dir.file("my.rules")));
 }
@@ -211,7 +205,7 @@ class VelkinDirectoryTest : public DaemonTest {
   // Runs setup and then tarvod in the namespace; prints "status=N" and the probe's output.
   RunResult runInNamespace(const std::string& setup, const std::string& probe) {
     const std::string config = dir.write(
-        "velkin.plist", ConfigPlist({{"errorLogPath", String("/var/log/velkin/tarvod.log")}}));
+        "velkin.plist", ConfigPlist({{"errorLogPath", Str("/var/log/velkin/tarvod.log")}}));
     const std::string script = "mount -t tmpfs tmpfs /var/log || exit 99; umask 022; " + setup +
                                "; '" + TarvodBinary() + "' -c '" + config + "' -r '" +
                                dir.file("missing") + "'; echo status=$?; " + probe;

@@ -13,6 +13,7 @@
 
 #include "harness.h"
 #include "platform/seqpacket.h"
+#include "rules_xml.h"
 
 namespace tarvod::testing {
 namespace {
@@ -31,8 +32,6 @@ constexpr bool kMeasuresOwnMemory = false;
 constexpr bool kMeasuresOwnMemory = true;
 #endif
 
-std::string String(std::string_view s) { return "<string>" + std::string(s) + "</string>"; }
-
 size_t CountLines(const std::string& path) {
   if (!FileExists(path)) return 0;
   const std::string text = ReadFile(path);
@@ -43,16 +42,15 @@ TEST(Load, EveryEventOfEightConcurrentSendersIsCountedInBoundedMemory) {
   TempDir dir;
   const std::string socketPath = dir.file("run/evtq");
   const std::string counted = dir.file("counted.log");
-  const std::string config = dir.write(
-      "tarvod.plist", ConfigPlist({{"errorLogPath", String(dir.file("error.log"))},
-                                   {"structuredLogPath", String(dir.file("records.jsonl"))},
-                                   {"stateDirectory", String(dir.file("state"))},
-                                   {"eventSocketPath", String(socketPath)}}));
-  const std::string rule = "<dict><key>name</key>" + String("count") +
-                           "<key>eventTypes</key><array>" + String("load") +
-                           "</array><key>actions</key><array><dict><key>type</key>" +
-                           String("log") + "<key>message</key>" + String("${event:n}") +
-                           "<key>logPath</key>" + String(counted) + "</dict></array></dict>";
+  const std::string config =
+      dir.write("tarvod.plist", ConfigPlist({{"errorLogPath", Str(dir.file("error.log"))},
+                                             {"structuredLogPath", Str(dir.file("records.jsonl"))},
+                                             {"stateDirectory", Str(dir.file("state"))},
+                                             {"eventSocketPath", Str(socketPath)}}));
+  const std::string rule = "<dict><key>name</key>" + Str("count") + "<key>eventTypes</key><array>" +
+                           Str("load") + "</array><key>actions</key><array><dict><key>type</key>" +
+                           Str("log") + "<key>message</key>" + Str("${event:n}") +
+                           "<key>logPath</key>" + Str(counted) + "</dict></array></dict>";
   const std::string rules = dir.write("rules.plist", PlistDocument("<array>" + rule + "</array>"));
   Daemon daemon({"-c", config, "-r", rules, "-n", "-v", "1"}, dir);
   ASSERT_TRUE(daemon.waitForLine(dir.file("error.log"), "Registered"));

@@ -13,6 +13,7 @@
 
 #include "harness.h"
 #include "platform/seqpacket.h"
+#include "rules_xml.h"
 
 namespace tarvod::testing {
 namespace {
@@ -20,13 +21,11 @@ namespace {
 using ::testing::HasSubstr;
 using ::testing::Not;
 
-std::string String(std::string_view s) { return "<string>" + std::string(s) + "</string>"; }
-
 // A message for the event socket: { eventType; eventDetails = { tag }; } plus extra XML keys.
 std::string EventMessage(std::string_view type, std::string_view tag,
                          std::string_view extraXml = {}) {
-  return PlistDocument("<dict><key>eventType</key>" + String(type) +
-                       "<key>eventDetails</key><dict><key>tag</key>" + String(tag) + "</dict>" +
+  return PlistDocument("<dict><key>eventType</key>" + Str(type) +
+                       "<key>eventDetails</key><dict><key>tag</key>" + Str(tag) + "</dict>" +
                        std::string(extraXml) + "</dict>");
 }
 
@@ -61,18 +60,18 @@ class SourcesTest : public ::testing::Test {
 
   void startDaemon(std::vector<std::pair<std::string, std::string>> extraConfig = {}) {
     std::vector<std::pair<std::string, std::string>> config = {
-        {"errorLogPath", String(dir.file("error.log"))},
-        {"structuredLogPath", String(dir.file("records.jsonl"))},
-        {"stateDirectory", String(dir.file("state"))},
-        {"eventSocketPath", String(mSocketPath)},
+        {"errorLogPath", Str(dir.file("error.log"))},
+        {"structuredLogPath", Str(dir.file("records.jsonl"))},
+        {"stateDirectory", Str(dir.file("state"))},
+        {"eventSocketPath", Str(mSocketPath)},
     };
     config.insert(config.end(), extraConfig.begin(), extraConfig.end());
     mConfigPath = dir.write("tarvod.plist", ConfigPlist(config));
     const std::string rule =
-        "<dict><key>name</key>" + String("record") + "<key>eventTypes</key><array>" + String("t") +
-        "</array><key>actions</key><array><dict><key>type</key>" + String("log") +
-        "<key>message</key>" + String("${event:tag} ${event:senderUID} ${event:senderGID}") +
-        "<key>logPath</key>" + String(eventsLog()) + "</dict></array></dict>";
+        "<dict><key>name</key>" + Str("record") + "<key>eventTypes</key><array>" + Str("t") +
+        "</array><key>actions</key><array><dict><key>type</key>" + Str("log") +
+        "<key>message</key>" + Str("${event:tag} ${event:senderUID} ${event:senderGID}") +
+        "<key>logPath</key>" + Str(eventsLog()) + "</dict></array></dict>";
     const std::string rules =
         dir.write("rules.plist", PlistDocument("<array>" + rule + "</array>"));
     mDaemon = std::make_unique<Daemon>(
@@ -119,8 +118,8 @@ TEST_F(SourcesTest, TheSenderFilterDecidesWhichSendersReachARule) {
   for (const FilterCase& c : cases) {
     SCOPED_TRACE(c.name);
     std::vector<std::pair<std::string, std::string>> filters;
-    if (c.uids) filters.push_back({"filterByUID", String(c.uids)});
-    if (c.gids) filters.push_back({"filterByGID", String(c.gids)});
+    if (c.uids) filters.push_back({"filterByUID", Str(c.uids)});
+    if (c.gids) filters.push_back({"filterByGID", Str(c.gids)});
     std::filesystem::remove(eventsLog());
     std::filesystem::remove(errorLog());
     startDaemon(filters);
@@ -164,7 +163,7 @@ TEST_F(SourcesTest, TheSenderFilterDecidesWhichSendersReachARule) {
 TEST_F(SourcesTest, ASendersOwnSenderUIDIsKept) {
   startDaemon();
   ASSERT_TRUE(SendAs(1001, 3000, mSocketPath,
-                     EventMessage("t", "own", "<key>senderUID</key>" + String("chosen"))));
+                     EventMessage("t", "own", "<key>senderUID</key>" + Str("chosen"))));
   EXPECT_TRUE(waitForEvent("own chosen 3000\n")) << log();
 }
 
