@@ -8,7 +8,7 @@
 #include <string>
 
 #include "actions/log_action.h"
-#include "engine/dispatch.h"
+#include "engine/engine.h"
 #include "engine/event_record.h"
 #include "engine/keyword_tables.h"
 #include "platform/diagnostic_log.h"
@@ -46,8 +46,7 @@ void BM_DispatchThroughRuleWithFileLog(benchmark::State& state) {
   BuildLevelNameTable();
   const std::string dir = BenchDirectory();
   ConfigureStructuredLog(dir + "/records.jsonl");
-  auto variables = std::make_shared<VariableStore>();
-  variables->set(kGlobalsKey, Dictionary{});
+  Engine engine(Clock::System(), Dictionary{});
   auto rulebase = std::make_shared<Rulebase>();
   (*rulebase)["auth.failure"].rules = {std::make_shared<const Rule>(Dictionary{
       {"name", "failed login"},
@@ -62,12 +61,13 @@ void BM_DispatchThroughRuleWithFileLog(benchmark::State& state) {
                       {"message", "failed login for ${event:username} from ${event:clientIP}"},
                       {"logPath", dir + "/auth.log"}})}},
   })};
+  engine.swapRulebase(rulebase);
   const Dictionary event = AuthFailure();
   for (auto _ : state) {
-    DispatchEvent(rulebase, event, variables);
-    ProcessingQueue().waitUntilPendingAtMost(256);
+    engine.dispatchEvent(event);
+    engine.queue().waitUntilPendingAtMost(256);
   }
-  ProcessingQueue().drain();
+  engine.queue().drain();
   state.SetItemsProcessed(state.iterations());
   std::filesystem::remove(dir + "/auth.log");
   std::filesystem::remove(dir + "/records.jsonl");

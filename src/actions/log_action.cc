@@ -12,6 +12,7 @@
 #include <utility>
 
 #include "platform/diagnostic_log.h"
+#include "platform/serial_queue.h"
 #include "platform/structured_log.h"
 
 namespace tarvod {
@@ -58,27 +59,8 @@ int Severity(const plist::Value* logLevel) {
   return kNoticeSeverity;
 }
 
-// Text form of an action key, resolved. nullopt means "stop": the error was logged. An absent
-// key, or a reference to nothing, gives an absent text.
-std::optional<std::optional<std::string>> ResolvedText(const plist::Dictionary& action,
-                                                       std::string_view key,
-                                                       const std::string& filePath,
-                                                       Context& context) {
-  const plist::Value* value = action.find(key);
-  if (value == nullptr) return std::optional<std::string>();
-  ErrorSlot error;
-  std::optional<plist::Value> resolved =
-      context.resolveVariablesInString(value->textForm(), filePath, &error);
-  if (error) {
-    LogMessage(0, "Error: %s", error->description.c_str());
-    return std::nullopt;
-  }
-  if (!resolved) return std::optional<std::string>();
-  return std::optional<std::string>(resolved->textForm());
-}
-
 void LogToStructuredLog(const plist::Dictionary& action, const std::string& logType,
-                        const std::string& message, const std::string& filePath, Context& context) {
+                        const std::string& message, const FiredRule& rule, Context& context) {
   LogAttributes attributes;
   if (const plist::Value* facility = action.find("facility")) {
     attributes.emplace_back("Facility", facility->textForm());
@@ -91,7 +73,7 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
       }
       ErrorSlot error;
       std::optional<plist::Value> resolved =
-          context.resolveVariablesInDictionary(details->dictionary(), filePath, &error);
+          context.resolveVariablesInDictionary(details->dictionary(), rule.filePath, &error);
       if (error) {
         LogMessage(0, "Error: %s", error->description.c_str());
         return;
@@ -105,7 +87,12 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
   }
   const int severity = Severity(action.find("logLevel"));
   // The message travels as data, never as a format: "%" in it reaches the log unchanged.
-  if (!DefaultStructuredLog().send(severity, message, attributes)) {
+  bool sent;
+  {
+    SerialQueue::BlockingSection blocking;
+    sent = DefaultStructuredLog().send(severity, message, attributes);
+  }
+  if (!sent) {
     LogMessage(0, "DoLogAction: Cannot send message to the structured log");
   }
 }
@@ -149,31 +136,31 @@ void BuildLevelNameTable() {
   });
 }
 
-void DoLogAction(const plist::Dictionary& action, const Rule& rule, Context& context) {
-  const plist::Value* filePathValue = rule.find("filePath");
-  const std::string filePath = filePathValue ? filePathValue->textForm() : std::string();
-
-  const auto resolvedMessage = ResolvedText(action, "message", filePath, context);
+void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule,
+                        Context& context) {
+  const auto resolvedMessage = ResolveActionText(action, "message", rule, context);
   if (!resolvedMessage) return;
   if (!*resolvedMessage || (*resolvedMessage)->empty()) return;
   const std::string message = UnescapeColonsInString(**resolvedMessage);
   if (message.empty()) return;
 
-  const auto logType = ResolvedText(action, "logType", filePath, context);
+  const auto logType = ResolveActionText(action, "logType", rule, context);
   if (!logType) return;
   const std::string type = *logType ? LowerCase(**logType) : std::string();
 
   // Resolved even for the structured log: an error in it ends the action either way.
-  const auto logPath = ResolvedText(action, "logPath", filePath, context);
+  const auto logPath = ResolveActionText(action, "logPath", rule, context);
   if (!logPath) return;
 
   LogMessage(3, "DoLogAction: logMessage is [%s]", message.c_str());
 
   if (type == "syslog" || type == "kvlog") {
-    LogToStructuredLog(action, type, message, filePath, context);
+    LogToStructuredLog(action, type, message, rule, context);
     return;
   }
   if (!*logPath) return;
+  // A slow or stuck file must not keep shutdown from saving the store.
+  SerialQueue::BlockingSection blocking;
   LogToFile(**logPath, message);
 }
 

@@ -3,12 +3,14 @@
 // startup, before any rule. Failures are logged and end only the action.
 #pragma once
 
-#include "context/context.h"
-#include "plist/value.h"
+#include "actions/action.h"
 
 namespace tarvod {
 
-void DoLogAction(const plist::Dictionary& action, const Rule& rule, Context& context);
+class LogAction final : public Action {
+ public:
+  void perform(const plist::Dictionary& action, const FiredRule& rule, Context& context) override;
+};
 // Builds the level-name table ("emergency" 0 to "debug" 7); later calls leave it as it is.
 void BuildLevelNameTable();
 

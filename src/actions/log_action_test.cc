@@ -39,7 +39,8 @@ class LogActionTest : public ::testing::Test {
   void TearDown() override { ConfigureStructuredLog(""); }
   void Run(Dictionary action) {
     action.set("type", Value("log"));
-    DoLogAction(action, Dictionary{{"filePath", kRulesFile}}, *context_);
+    const Dictionary rule{{"filePath", kRulesFile}};
+    LogAction().perform(action, FiredRule{rule, "log", kRulesFile}, *context_);
   }
   std::vector<testing::JsonRecord> Records() const { return testing::ReadJsonRecords(records_); }
 

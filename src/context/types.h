@@ -1,8 +1,8 @@
 // The daemon-wide shared containers: the variable store and the rulebase.
 //
-// The variable store is touched only on the processing queue; main-thread work on it (rule
-// loading at reload, saving state) runs there as a synchronous job. The rulebase is built
-// by the loader and then only read, except for the atomic per-type event counters.
+// The variable store is touched only on the processing queue; the Engine that owns it hands
+// it to other threads only through its queue (Engine::withVariables). The rulebase is built
+// by the loader and then shared as const, except for the atomic per-type event counters.
 #pragma once
 
 #include <atomic>
@@ -27,13 +27,13 @@ using RulePtr = std::shared_ptr<const Rule>;
 struct RulebaseEntry {
   std::vector<RulePtr> rules;  // in load order; a rule listed under several types is shared
   // Events of this type dispatched since the rules were loaded.
-  std::atomic<uint64_t> eventCounter{0};
-  std::atomic<double> lastEventTimestamp{0.0};
+  mutable std::atomic<uint64_t> eventCounter{0};
+  mutable std::atomic<double> lastEventTimestamp{0.0};
 };
 
 // Event type to entry. std::map keeps entries at stable addresses.
 using Rulebase = std::map<std::string, RulebaseEntry>;
-using RulebasePtr = std::shared_ptr<Rulebase>;
+using RulebasePtr = std::shared_ptr<const Rulebase>;
 
 // The rulebase as a property-list value: { type = { rules = (...); eventCounter = n;
 // lastEventTimestamp = t; }; }, for messages and dumps.

@@ -1,87 +1,26 @@
 #include "daemon/daemon.h"
 
-#include <systemd/sd-event.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <cstdio>
-#include <filesystem>
-#include <memory>
-#include <optional>
-#include <string>
 
 #include "actions/log_action.h"
-#include "context/types.h"
 #include "daemon/configuration.h"
 #include "daemon/logs.h"
+#include "daemon/options.h"
 #include "daemon/signals.h"
-#include "engine/dispatch.h"
-#include "engine/keyword_tables.h"
-#include "engine/rules_loader.h"
+#include "daemon/state.h"
 #include "platform/diagnostic_log.h"
 #include "platform/host_stats.h"
+#include "platform/main_loop.h"
 #include "platform/structured_log.h"
-#include "plist/value.h"
 #include "sources/event_listener.h"
-#include "sources/monitor.h"
+#include "sources/monitor_engine.h"
 
 namespace tarvod {
 namespace {
 
 constexpr uint64_t kSliceMicroseconds = 5'000'000;
-
-struct Options {
-  std::string configurationPath = kDefaultConfigurationPath;
-  std::string rulesPath;  // empty: the default
-  int64_t debugLevel = 0;
-  bool restoreState = true;
-};
-
-// Parses "r:c:nv:"; false on an unknown letter or a missing argument.
-bool ParseOptions(int argc, char** argv, Options& options) {
-  opterr = 0;  // the usage line is the only text a bad command line produces
-  int letter;
-  while ((letter = getopt(argc, argv, "r:c:nv:")) != -1) {
-    switch (letter) {
-      case 'r':
-        options.rulesPath = optarg;
-        break;
-      case 'c':
-        options.configurationPath = optarg;
-        break;
-      case 'n':
-        options.restoreState = false;
-        break;
-      case 'v':
-        options.debugLevel = plist::LeadingInteger(optarg);
-        break;
-      default:
-        return false;
-    }
-  }
-  return true;
-}
-
-std::string NowText() {
-  return plist::FormatDate(plist::Date{static_cast<double>(time(nullptr)) -
-                                       plist::kUnixTimeOfReferenceDate},
-                           true);
-}
-
-// The extension of the path's last component ("rules.plist" -> "plist", "rules/" -> "").
-std::string PathExtension(std::string path) {
-  while (path.size() > 1 && path.back() == '/') path.pop_back();
-  const std::string name = std::filesystem::path(path).filename().string();
-  const size_t dot = name.rfind('.');
-  if (dot == std::string::npos || dot == 0 || dot + 1 == name.size()) return "";
-  return name.substr(dot + 1);
-}
-
-size_t LoadRules(const RulebasePtr& rulebase, const VariableStorePtr& variables,
-                 const std::string& rulesPath) {
-  if (!PathExtension(rulesPath).empty()) return LoadRulesFile(rulebase, variables, rulesPath);
-  return LoadRulesDirectory(rulebase, variables, rulesPath);
-}
+constexpr int64_t kDefaultShutdownTimeout = 10;
 
 // The audit session of this process, as the security-session message reports it.
 void LogSecuritySession() {
@@ -99,129 +38,148 @@ void LogSecuritySession() {
   LogMessage(4, "Velkin security session id = %x (%d)", static_cast<unsigned>(session), status);
 }
 
-int OnSignalWake(sd_event_source*, int, uint32_t, void*) {
-  ClearSignalWake();
-  return 0;
+std::optional<IdSet> FilterList(const plist::Dictionary& configuration, const char* key) {
+  const plist::Value* value = configuration.find(key);
+  return ParseFilterList(value ? std::optional<std::string>(value->textForm()) : std::nullopt);
 }
 
 }  // namespace
 
-int DaemonMain(int argc, char** argv) {
-  // Step 1: the empty globals.
-  plist::Dictionary globals;
+Daemon::Daemon(const Clock& clock, Files& files) : mClock(clock), mFiles(files) {}
 
-  // Steps 2 and 3: signals, then the command line.
+Daemon::~Daemon() {
+  // The sources go first: they dispatch into the engine until their thread is joined.
+  mMonitor.reset();
+  mEngine.reset();
+}
+
+std::optional<int> Daemon::startup(int argc, char** argv) {
+  plist::Dictionary globals;
   InstallSignalHandlers();
-  Options options;
-  if (!ParseOptions(argc, argv, options)) {
+  const std::optional<Options> options = ParseOptions(argc, argv);
+  if (!options) {
     std::fprintf(stderr, "Usage: %s [ -r <rules.plist>] [-c <config file> ] [-v <debug level>] [-n]\n",
                  argv[0]);
     return 255;
   }
 
-  // Step 4: configuration, seeded with the default rules path.
-  plist::Dictionary configuration{{"rulesPath", plist::Value(kDefaultRulesPath)}};
-  LoadConfiguration(options.configurationPath, &globals, &configuration);
-
-  // Step 5: logs.
-  if (SetUpLogs(configuration) != 0) {
+  mConfigurationPath = options->configurationPath;
+  mConfiguration = plist::Dictionary{{"rulesPath", plist::Value(kDefaultRulesPath)}};
+  LoadConfiguration(mConfigurationPath, &globals, &mConfiguration);
+  if (SetUpLogs(mConfiguration) != 0) {
     CloseLogs();
     return 255;
   }
-
-  // Step 6: debug level.
-  if (options.debugLevel != 0) {
-    SetDebugLevel(options.debugLevel);
-  } else if (configuration.contains("debugLevel")) {
-    SetDebugLevel(ConfigurationInteger(configuration, "debugLevel"));
+  if (options->debugLevel != 0) {
+    SetDebugLevel(options->debugLevel);
+  } else if (mConfiguration.contains("debugLevel")) {
+    SetDebugLevel(ConfigurationInteger(mConfiguration, "debugLevel"));
   }
+  LogMessage(0, "Velkin Started %s", LocalDateText(mClock).c_str());
 
-  LogMessage(0, "Velkin Started %s", NowText().c_str());
-
-  // Step 8: the variable store.
-  auto variables = std::make_shared<VariableStore>();
-  variables->set(kGlobalsKey, plist::Value(std::move(globals)));
-
-  // Step 9: saved state.
-  if (options.restoreState) {
+  mEngine = std::make_unique<Engine>(mClock, std::move(globals));
+  if (options->restoreState) {
     LogMessage(1, "Restoring saved state");
+    RestoreState(mConfiguration, *mEngine, mFiles);
   }
-
   LogSecuritySession();
 
-  // Step 11: rules path.
-  const std::string rulesPath = options.rulesPath.empty() ? kDefaultRulesPath : options.rulesPath;
-  LogMessage(4, "Velkin rules path is %s", rulesPath.c_str());
-  configuration.set("rulesPath", plist::Value(rulesPath));
-
-  BuildKeywordTables();
+  mRulesPath = options->rulesPath.value_or(kDefaultRulesPath);
+  LogMessage(4, "Velkin rules path is %s", mRulesPath.c_str());
+  mConfiguration.set("rulesPath", plist::Value(mRulesPath));
   BuildLevelNameTable();
   InitHostStats();
-  ConfigureStructuredLog(ConfigurationString(configuration, "structuredLogPath", ""));
+  ConfigureStructuredLog(ConfigurationString(mConfiguration, "structuredLogPath", ""));
 
-  // Steps 15 to 18: the rules.
-  auto rulebase = std::make_shared<Rulebase>();
-  const size_t ruleCount = LoadRules(rulebase, variables, rulesPath);
+  size_t ruleCount = 0;
+  mEngine->swapRulebase(mEngine->loadRules(mRulesPath, &ruleCount));
   LogMessage(1, "Loaded %zu rules\n", ruleCount);
   if (ruleCount == 0) {
-    LogMessage(0, "No rules found in %s, quitting....", rulesPath.c_str());
-    LogMessage(0, "Velkin Shutdown at %s", NowText().c_str());
+    LogMessage(0, "No rules found in %s, quitting....", mRulesPath.c_str());
+    LogMessage(0, "Velkin Shutdown at %s", LocalDateText(mClock).c_str());
     CloseLogs();
     return 0;
   }
 
-  // Step 19: Monitor.
-  auto monitor = std::make_unique<Monitor>(rulebase, variables);
-  monitor->setEventSocketPath(
-      ConfigurationString(configuration, "eventSocketPath", kDefaultEventSocketPath));
-  // Step 20: sender filter.
-  const auto filterText = [&](const char* key) -> std::optional<std::string> {
-    const plist::Value* value = configuration.find(key);
-    return value ? std::optional<std::string>(value->textForm()) : std::nullopt;
-  };
-  monitor->setEventFilterUID(ParseFilterList(filterText("filterByUID")),
-                             ParseFilterList(filterText("filterByGID")));
-  PostStartupEvent(rulebase, variables, false);
-  // Step 22: periodic events.
-  // Step 23: notification observers.
-  // Step 24: begin listening.
-  monitor->beginListening();
+  mMonitor = std::make_unique<Monitor>(EngineHooks(*mEngine));
+  mMonitor->setEventSocketPath(
+      ConfigurationString(mConfiguration, "eventSocketPath", kDefaultEventSocketPath));
+  mMonitor->setEventFilterUID(FilterList(mConfiguration, "filterByUID"),
+                              FilterList(mConfiguration, "filterByGID"));
+  mEngine->postStartupEvent(false);
+  mMonitor->beginListening();
   LogMessage(1, "Registered %d events", 0);
-  // Step 26: enable the companion log job.
+  NotifyServiceManager("READY=1");
+  return std::nullopt;
+}
 
-  // The main loop: one sd_event_run of at most five seconds per slice, then the requests.
-  sd_event* loop = nullptr;
-  sd_event_default(&loop);
-  sd_event_source* wakeSource = nullptr;
-  if (loop) {
-    sd_event_add_io(loop, &wakeSource, SignalWakeDescriptor(), EPOLLIN, OnSignalWake, nullptr);
-  }
+void Daemon::runMainLoop() {
+  MainLoop loop;
+  loop.watch(SignalWakeDescriptor(), ClearSignalWake);
   for (;;) {
-    if (loop) {
-      sd_event_run(loop, kSliceMicroseconds);
-    } else {
-      usleep(kSliceMicroseconds);  // no loop could be made: still honour requests per slice
-    }
-    if (TakeStopRequest()) break;
+    const bool canRun = loop.runSlice(kSliceMicroseconds);
+    if (TakeStopRequest()) return;
     if (TakeReloadRequest()) {
-      // Reload rules.
+      ReloadRules();
+      // Only the file's initialGlobals are read again: they reset the globals they name.
+      plist::Dictionary initialGlobals;
+      LoadConfiguration(mConfigurationPath, &initialGlobals, nullptr);
+      mEngine->withVariables([&](VariableStore& store) {
+        plist::Value* globals = store.find(kGlobalsKey);
+        if (globals == nullptr || !globals->isDictionary()) {
+          store.set(kGlobalsKey, plist::Value(plist::Dictionary()));
+          globals = store.find(kGlobalsKey);
+        }
+        for (auto& [key, value] : initialGlobals) globals->dictionary().set(key, value);
+      });
+      NotifyServiceManager("READY=1");
     }
+    if (!canRun) return;
+  }
+}
+
+void Daemon::ReloadRules() {
+  NotifyServiceManager("RELOADING=1");
+  LogMessage(1, "Reloading Rules");
+  // New connections wait in the listen backlog; accepted ones and the audit source go on
+  // delivering, against the old rulebase until the swap and the new one after it.
+  mMonitor->suspend();
+  size_t ruleCount = 0;
+  RulebasePtr rulebase = mEngine->loadRules(mRulesPath, &ruleCount);
+  LogMessage(1, "Loaded %zu rules\n", ruleCount);
+  mEngine->swapRulebase(std::move(rulebase));
+  mEngine->postStartupEvent(true);
+  mMonitor->resume();
+}
+
+void Daemon::Shutdown() {
+  NotifyServiceManager("STOPPING=1");
+  mEngine->postShutdownEvent();
+  mMonitor->stopListening();
+  mEngine->closeDispatch();
+
+  // A rule blocked for good (a FIFO nobody reads, a child that never exits) must not keep
+  // the daemon from stopping: after the timeout what is left is reported and dropped.
+  int64_t timeout = kDefaultShutdownTimeout;
+  if (mConfiguration.contains("shutdownTimeout")) {
+    timeout = std::max<int64_t>(0, ConfigurationInteger(mConfiguration, "shutdownTimeout"));
+  }
+  if (const size_t pending = mEngine->drain(static_cast<double>(timeout))) {
+    LogMessage(0, "Shutdown: %zu rule jobs still pending after %lld seconds; stopping without them",
+               pending, static_cast<long long>(timeout));
   }
 
-  PostShutdownEvent(rulebase, variables);
-  // Stop the sources.
-  monitor->stopListening();
-  // The shutdown rules, and those of every event the sources had already read, run before
-  // the logs close.
-  ProcessingQueue().drain();
-  LogMessage(0, "Velkin Shutdown at %s", NowText().c_str());
+  LogMessage(1, "Saving the global state...");
+  SaveState(mConfiguration, *mEngine, mFiles);
+  LogMessage(0, "Velkin Shutdown at %s", LocalDateText(mClock).c_str());
   CloseLogs();
-  // Connections accepted earlier may still deliver until the input thread is gone; after it
-  // is joined and the last jobs have run, nothing else touches the daemon's objects at exit.
-  monitor.reset();
-  ProcessingQueue().drain();
-  sd_event_source_unref(wakeSource);
-  sd_event_unref(loop);
+}
+
+int DaemonMain(int argc, char** argv) {
+  Daemon daemon(Clock::System(), Files::Real());
+  if (std::optional<int> status = daemon.startup(argc, argv)) return *status;
+  daemon.runMainLoop();
+  daemon.Shutdown();
   return 0;
 }
 

@@ -1,11 +1,49 @@
-// The daemon's main: command line, configuration, start of every part, the main loop in
-// 5-second slices, and the orderly stop. Main thread.
+// The daemon: startup from the command line and configuration, the main loop in 5-second
+// slices, reload on SIGHUP and the orderly stop. It owns the configuration, the Engine and
+// the Monitor. Main thread only.
 #pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "engine/engine.h"
+#include "platform/clock.h"
+#include "platform/files.h"
+#include "plist/value.h"
+#include "sources/monitor.h"
 
 namespace tarvod {
 
-// Returns the process exit status: 255 for a usage error or logs that cannot be opened,
-// 0 when no rules were found and after a normal stop.
+class Daemon {
+ public:
+  Daemon(const Clock& clock, Files& files);
+  ~Daemon();
+  Daemon(const Daemon&) = delete;
+  Daemon& operator=(const Daemon&) = delete;
+
+  // Everything up to the main loop. nullopt: the daemon runs; otherwise the exit status
+  // (255 for a usage error or logs that cannot be opened, 0 when no rules were found).
+  std::optional<int> startup(int argc, char** argv);
+  // Slices until a stop is requested, reloading when asked.
+  void runMainLoop();
+  // SIGHUP: a new rulebase, swapped in while the sources keep delivering.
+  void ReloadRules();
+  // The shutdown event, the sources stopped, the queue drained within shutdownTimeout, the
+  // state saved, the logs closed. The last thing the daemon does.
+  void Shutdown();
+
+ private:
+  const Clock& mClock;
+  Files& mFiles;
+  std::string mConfigurationPath;
+  plist::Dictionary mConfiguration;
+  std::string mRulesPath;
+  std::unique_ptr<Engine> mEngine;
+  std::unique_ptr<Monitor> mMonitor;
+};
+
+// main: the process exit status.
 int DaemonMain(int argc, char** argv);
 
 }  // namespace tarvod

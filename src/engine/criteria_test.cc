@@ -192,8 +192,6 @@ TEST(KeywordTables, HoldTheOperatorAndActionCodes) {
   EXPECT_EQ(ActionCode("runcommand"), 10);
   EXPECT_EQ(ActionCode("debugdump"), 13);
   EXPECT_EQ(ActionCode("sendfax"), std::nullopt);
-  EXPECT_EQ(ProcessingQueue().label(), "com.quenta.tarvod.processq");
-  EXPECT_EQ(&ProcessingQueue(), &ProcessingQueue());
 }
 
 }  // namespace

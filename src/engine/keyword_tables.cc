@@ -59,19 +59,11 @@ void BuildKeywordTables() {
   std::call_once(once, [] {
     OperatorTable();
     ActionTable();
-    ProcessingQueue();
   });
 }
 
 std::optional<int> OperatorCode(std::string_view keyword) { return Find(OperatorTable(), keyword); }
 
 std::optional<int> ActionCode(std::string_view keyword) { return Find(ActionTable(), keyword); }
-
-SerialQueue& ProcessingQueue() {
-  // Lives until the process ends: never destroyed, so no job can outlive the objects a
-  // destructor at exit would tear down under it.
-  static SerialQueue* const queue = new SerialQueue("com.quenta.tarvod.processq");
-  return *queue;
-}
 
 }  // namespace tarvod

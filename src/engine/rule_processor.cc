@@ -7,6 +7,7 @@
 
 #include "engine/rules_loader.h"
 #include "platform/diagnostic_log.h"
+#include "platform/serial_queue.h"
 
 namespace tarvod {
 namespace {
@@ -101,7 +102,12 @@ bool ProcessRule(const Rule& rule, Context& context) {
   if (const plist::Value* fromFile = rule.find("loadVariablesFromFile")) {
     const std::string path = fromFile->textForm();
     LogMessage(3, "    processing variables from file: %s.", path.c_str());
-    if (std::optional<plist::Dictionary> loaded = LoadVariablesFile(path)) {
+    std::optional<plist::Dictionary> loaded;
+    {
+      SerialQueue::BlockingSection blocking;  // the file may be slow, or a FIFO
+      loaded = LoadVariablesFile(path);
+    }
+    if (loaded) {
       AssignVariables(*loaded, filePath, context);
     } else {
       LogMessage(3, "        failed to load variables from %s", path.c_str());
@@ -118,9 +124,10 @@ bool ProcessRule(const Rule& rule, Context& context) {
   }
   if (const plist::Array* actions = rule.findArray("actions")) {
     static const plist::Dictionary kNoAction;
+    const FiredRule fired{rule, name, filePath};
     for (const plist::Value& action : *actions) {
       const plist::Dictionary* dictionary = action.asDictionary();
-      ProcessAction(dictionary ? *dictionary : kNoAction, rule, context);
+      ProcessAction(dictionary ? *dictionary : kNoAction, fired, context);
     }
   }
   LogMessage(2, "%s", "");

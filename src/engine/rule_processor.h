@@ -2,6 +2,7 @@
 // the processing queue.
 #pragma once
 
+#include "actions/action.h"
 #include "context/context.h"
 
 namespace tarvod {
@@ -12,7 +13,7 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
 // does not exist.
 bool IsUserInGroup(const std::string& user, const std::string& group);
 // Runs one action entry of a fired rule.
-void ProcessAction(const plist::Dictionary& action, const Rule& rule, Context& context);
+void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Context& context);
 // True when the rule fired.
 bool ProcessRule(const Rule& rule, Context& context);
 

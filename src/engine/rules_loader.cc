@@ -19,11 +19,12 @@ std::string RuleName(const plist::Dictionary& rule) {
 }
 
 // Assigns a rule's "eval on load" variables, keys in ascending order.
-void AssignLoadTimeVariables(const RulebasePtr& rulebase, const VariableStorePtr& variables,
-                             const std::string& variablesPath, const std::string& rulesFile) {
+void AssignLoadTimeVariables(const VariableStorePtr& variables, const std::string& variablesPath,
+                             const std::string& rulesFile) {
   LogMessage(3, "  preparing the \"eval on load\" vairables (from path %s)", variablesPath.c_str());
   if (std::optional<plist::Dictionary> loaded = LoadVariablesFile(variablesPath)) {
-    Context context(variables, rulebase);
+    // The rulebase is still being built: the context has none to show.
+    Context context(variables, nullptr);
     for (const std::string& key : loaded->sortedKeys()) {
       context.setVariableValue(*loaded->find(key), key, rulesFile);
     }
@@ -42,7 +43,7 @@ std::optional<plist::Dictionary> LoadVariablesFile(const std::string& path) {
   return std::move(file->dictionary());
 }
 
-size_t LoadRulesFile(const RulebasePtr& rulebase, const VariableStorePtr& variables,
+size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables,
                      const std::string& path) {
   std::optional<plist::Value> file = plist::ReadPropertyListFile(path);
   if (!file || !file->isArray()) return 0;
@@ -62,13 +63,13 @@ size_t LoadRulesFile(const RulebasePtr& rulebase, const VariableStorePtr& variab
     const plist::Array types = *eventTypes;
     source->set("filePath", plist::Value(path));
     if (const plist::Value* loadWith = source->find("loadVariablesWithRule")) {
-      AssignLoadTimeVariables(rulebase, variables, loadWith->textForm(), path);
+      AssignLoadTimeVariables(variables, loadWith->textForm(), path);
     }
     auto rule = std::make_shared<const Rule>(std::move(*source));
     for (const plist::Value& type : types) {
       // Types are matched as exact strings; anything else in the list cannot match an event.
       const std::string key = type.textForm();
-      (*rulebase)[key].rules.push_back(rule);
+      rulebase[key].rules.push_back(rule);
       LogMessage(3, "  Added rule: %s", name.c_str());
     }
     ++accepted;
@@ -77,7 +78,7 @@ size_t LoadRulesFile(const RulebasePtr& rulebase, const VariableStorePtr& variab
   return accepted;
 }
 
-size_t LoadRulesDirectory(const RulebasePtr& rulebase, const VariableStorePtr& variables,
+size_t LoadRulesDirectory(Rulebase& rulebase, const VariableStorePtr& variables,
                           const std::string& path) {
   LogMessage(3, "Loading rules files from %s\n", path.c_str());
   // Entries are visited depth first, each directory's entries sorted by name, so that the

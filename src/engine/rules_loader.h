@@ -1,6 +1,7 @@
 // Rules files: LoadRulesFile reads one property-list array of rules into the rulebase,
 // LoadRulesDirectory every file below a directory; both return how many rules they accepted.
-// Runs on the main thread at startup, as a job on the processing queue at reload.
+// The rulebase being filled is private to the caller until it is complete; the variable store
+// is written by "eval on load" variables, so the Engine runs loading on its queue.
 #pragma once
 
 #include <optional>
@@ -11,9 +12,9 @@
 
 namespace tarvod {
 
-size_t LoadRulesFile(const RulebasePtr& rulebase, const VariableStorePtr& variables,
+size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables,
                      const std::string& path);
-size_t LoadRulesDirectory(const RulebasePtr& rulebase, const VariableStorePtr& variables,
+size_t LoadRulesDirectory(Rulebase& rulebase, const VariableStorePtr& variables,
                           const std::string& path);
 // A variables file's dictionary; nullopt (with its level-4 message) when it cannot be read.
 std::optional<plist::Dictionary> LoadVariablesFile(const std::string& path);

@@ -1,11 +1,29 @@
 #include "platform/serial_queue.h"
 
 #include <pthread.h>
+#include <sys/eventfd.h>
+#include <unistd.h>
+
+#include <chrono>
 
 namespace tarvod {
+namespace {
+
+thread_local SerialQueue* tCurrentQueue = nullptr;
+
+void Signal(int fd) {
+  const uint64_t one = 1;
+  [[maybe_unused]] ssize_t n = write(fd, &one, sizeof one);
+}
+
+}  // namespace
 
 SerialQueue::SerialQueue(std::string label) : mLabel(std::move(label)) {
-  mThread = std::thread([this] { run(); });
+  mProgressFd = eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
+  mThread = std::thread([this] {
+    tCurrentQueue = this;
+    run();
+  });
   // Thread names are limited to 15 bytes; the tail of the label is the telling part.
   std::string name = mLabel.size() > 15 ? mLabel.substr(mLabel.size() - 15) : mLabel;
   pthread_setname_np(mThread.native_handle(), name.c_str());
@@ -18,11 +36,13 @@ SerialQueue::~SerialQueue() {
   }
   mWorkAvailable.notify_all();
   if (mThread.joinable()) mThread.join();
+  if (mProgressFd >= 0) close(mProgressFd);
 }
 
 void SerialQueue::async(std::function<void()> job) {
   {
     std::lock_guard<std::mutex> lock(mLock);
+    if (mAbandoned) return;
     mJobs.push_back(std::move(job));
     ++mPending;
   }
@@ -37,6 +57,10 @@ void SerialQueue::sync(const std::function<void()>& job) {
   std::mutex doneLock;
   std::condition_variable doneSignal;
   bool done = false;
+  {
+    std::lock_guard<std::mutex> lock(mLock);
+    if (mAbandoned) return;
+  }
   async([&] {
     job();
     std::lock_guard<std::mutex> lock(doneLock);
@@ -45,6 +69,12 @@ void SerialQueue::sync(const std::function<void()>& job) {
   });
   std::unique_lock<std::mutex> lock(doneLock);
   doneSignal.wait(lock, [&] { return done; });
+}
+
+bool SerialQueue::drainFor(double seconds) {
+  std::unique_lock<std::mutex> lock(mLock);
+  return mProgress.wait_for(lock, std::chrono::duration<double>(seconds),
+                            [&] { return mPending == 0; });
 }
 
 size_t SerialQueue::pending() const {
@@ -57,6 +87,45 @@ void SerialQueue::waitUntilPendingAtMost(size_t limit) {
   mProgress.wait(lock, [&] { return mPending <= limit; });
 }
 
+void SerialQueue::signalWhenPendingAtMost(size_t limit) {
+  std::lock_guard<std::mutex> lock(mLock);
+  if (mPending <= limit) {
+    Signal(mProgressFd);
+    return;
+  }
+  mSignalLimit = limit;
+  mSignalArmed = true;
+}
+
+bool SerialQueue::runExclusive(const std::function<void()>& work, double seconds) {
+  if (isCurrentThread()) {
+    work();
+    return true;
+  }
+  std::unique_lock<std::timed_mutex> jobLock(mJobLock, std::chrono::duration<double>(seconds));
+  if (!jobLock.owns_lock()) return false;
+  work();
+  return true;
+}
+
+size_t SerialQueue::abandon() {
+  std::lock_guard<std::mutex> lock(mLock);
+  const size_t dropped = mJobs.size();
+  mJobs.clear();
+  mPending -= dropped;
+  mAbandoned = true;
+  mProgress.notify_all();
+  return dropped;
+}
+
+SerialQueue::BlockingSection::BlockingSection() : mQueue(tCurrentQueue) {
+  if (mQueue) mQueue->mJobLock.unlock();
+}
+
+SerialQueue::BlockingSection::~BlockingSection() {
+  if (mQueue) mQueue->mJobLock.lock();
+}
+
 void SerialQueue::run() {
   std::unique_lock<std::mutex> lock(mLock);
   for (;;) {
@@ -65,10 +134,17 @@ void SerialQueue::run() {
     std::function<void()> job = std::move(mJobs.front());
     mJobs.pop_front();
     lock.unlock();
-    job();
-    job = nullptr;  // release what the job captured before reporting progress
+    {
+      std::lock_guard<std::timed_mutex> jobLock(mJobLock);
+      job();
+      job = nullptr;  // release what the job captured before reporting progress
+    }
     lock.lock();
     --mPending;
+    if (mSignalArmed && mPending <= mSignalLimit) {
+      mSignalArmed = false;
+      Signal(mProgressFd);
+    }
     mProgress.notify_all();
   }
 }

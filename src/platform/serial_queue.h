@@ -1,6 +1,11 @@
 // A serial dispatch queue: one worker thread runs submitted jobs one at a time, in submission
-// order. async and sync may be called from any thread; sync called from the queue's own
-// thread runs the job at once (it would otherwise wait for itself).
+// order. async, sync and the waits may be called from any thread; sync called from the
+// queue's own thread runs the job at once (it would otherwise wait for itself).
+//
+// A job holds the queue's job lock while it runs, except inside a BlockingSection, which a
+// job opens around a call that may block for long (a write, a wait for a child). Another
+// thread can then still run work exclusive of the jobs with runExclusive: the one way to
+// reach the queue's data while a job is stuck.
 #pragma once
 
 #include <condition_variable>
@@ -16,7 +21,8 @@ namespace tarvod {
 class SerialQueue {
  public:
   explicit SerialQueue(std::string label);
-  // Runs every job already submitted, then joins the worker.
+  // Runs every job already submitted, then joins the worker. Must not be called while a job
+  // is stuck; see abandon.
   ~SerialQueue();
   SerialQueue(const SerialQueue&) = delete;
   SerialQueue& operator=(const SerialQueue&) = delete;
@@ -30,12 +36,39 @@ class SerialQueue {
   void drain() {
     sync([] {});
   }
+  // Waits until no job is pending or the monotonic deadline (seconds, steady clock) passes;
+  // true when the queue ran empty.
+  bool drainFor(double seconds);
 
   // Jobs submitted and not yet finished (the one running included).
   size_t pending() const;
   // Blocks the caller until at most limit jobs are pending.
   void waitUntilPendingAtMost(size_t limit);
+  // A non-blocking eventfd that becomes readable once at most limit jobs are pending, after
+  // signalWhenPendingAtMost(limit) asked for it. The reader empties it.
+  int progressDescriptor() const { return mProgressFd; }
+  void signalWhenPendingAtMost(size_t limit);
+
+  // Runs work on the calling thread while no job holds the job lock; false when that did not
+  // happen within seconds.
+  bool runExclusive(const std::function<void()>& work, double seconds);
+  // Drops every job not yet started and refuses new ones; returns how many were dropped.
+  // A job already running finishes (or stays stuck) on its own.
+  size_t abandon();
+
   bool isCurrentThread() const { return std::this_thread::get_id() == mThread.get_id(); }
+
+  // Releases the running job's lock for the section's lifetime; a no-op off a queue thread.
+  class BlockingSection {
+   public:
+    BlockingSection();
+    ~BlockingSection();
+    BlockingSection(const BlockingSection&) = delete;
+    BlockingSection& operator=(const BlockingSection&) = delete;
+
+   private:
+    SerialQueue* mQueue;
+  };
 
  private:
   void run();
@@ -47,6 +80,11 @@ class SerialQueue {
   std::deque<std::function<void()>> mJobs;
   size_t mPending = 0;
   bool mStopping = false;
+  bool mAbandoned = false;
+  size_t mSignalLimit = 0;
+  bool mSignalArmed = false;
+  int mProgressFd = -1;
+  std::timed_mutex mJobLock;
   std::thread mThread;
 };
 

@@ -150,10 +150,9 @@ TEST(AuditRecord, TerminalAddressesFormatByType) {
 
 TEST(AuditRecord, ConvertedEventsReachTheMonitor) {
   std::vector<plist::Dictionary> seen;
-  Monitor monitor(std::make_shared<Rulebase>(), std::make_shared<VariableStore>(),
-                  MonitorHooks{[&](const RulebasePtr&, const plist::Dictionary& event,
-                                   const VariableStorePtr&) { seen.push_back(event); },
-                               nullptr});
+  MonitorHooks hooks;
+  hooks.dispatch = [&](const plist::Dictionary& event) { seen.push_back(event); };
+  Monitor monitor(hooks);
   ConvertAuditRecord(RecordBuilder().header32(kSshLoginEvent).ret(0, 0).bytes, monitor);
   ConvertAuditRecord(RecordBuilder().header32(1).bytes, monitor);
   ASSERT_EQ(seen.size(), 1u);

@@ -1,5 +1,7 @@
 #include "sources/monitor.h"
 
+#include <unistd.h>
+
 #include <vector>
 
 #include "platform/diagnostic_log.h"
@@ -11,8 +13,6 @@ namespace tarvod {
 namespace {
 
 constexpr const char* kInputQueueLabel = "com.quenta.tarvod.inputq";
-// How often a closed read gate looks at the backlog again.
-constexpr uint64_t kBacklogPollMicroseconds = 1000;
 
 }  // namespace
 
@@ -29,10 +29,8 @@ std::optional<IdSet> ParseFilterList(std::optional<std::string_view> text) {
   return ids;
 }
 
-Monitor::Monitor(RulebasePtr rulebase, VariableStorePtr variables, MonitorHooks hooks)
-    : mRulebase(std::move(rulebase)),
-      mVariables(std::move(variables)),
-      mHooks(std::move(hooks)),
+Monitor::Monitor(MonitorHooks hooks)
+    : mHooks(std::move(hooks)),
       mEventSocketPath(kDefaultEventSocketPath) {}
 
 Monitor::~Monitor() {
@@ -42,18 +40,9 @@ Monitor::~Monitor() {
     mXPCEventConnection.reset();
     mBSMReadSource.reset();
     mPeers.reset();
+    mProgressSource.reset();
   });
   mInputEvtQ.reset();
-}
-
-RulebasePtr Monitor::rulebase() const {
-  std::lock_guard<std::mutex> lock(mRulebaseLock);
-  return mRulebase;
-}
-
-void Monitor::setRulebase(RulebasePtr rulebase) {
-  std::lock_guard<std::mutex> lock(mRulebaseLock);
-  mRulebase = std::move(rulebase);
 }
 
 void Monitor::setEventFilterUID(std::optional<IdSet> uids, std::optional<IdSet> gids) {
@@ -72,7 +61,7 @@ bool Monitor::filterBySourceUID(uint32_t uid, uint32_t gid) const {
 
 void Monitor::processEvent(const plist::Dictionary& event) {
   if (DebugLevel() >= 3) LogMessage(3, "Event received: %s ", plist::Describe(event).c_str());
-  if (mHooks.dispatch) mHooks.dispatch(rulebase(), event, mVariables);
+  if (mHooks.dispatch) mHooks.dispatch(event);
 }
 
 int Monitor::SetXPCListenerFor(EventLoop& queue) {
@@ -87,6 +76,12 @@ int Monitor::SetXPCListenerFor(EventLoop& queue) {
 
 void Monitor::beginListening() {
   if (!mInputEvtQ) mInputEvtQ = std::make_unique<EventLoop>(kInputQueueLabel);
+  if (mHooks.progressDescriptor >= 0) {
+    mInputEvtQ->sync([this] {
+      mProgressSource = mInputEvtQ->addIo(mHooks.progressDescriptor, EPOLLIN, false,
+                                          [this](uint32_t) { onBacklogProgress(); });
+    });
+  }
 
   LogMessage(1, "Starting the New XPC event listener");
   if (SetXPCListenerFor(*mInputEvtQ) != 0) {
@@ -116,6 +111,7 @@ void Monitor::stopListening() {
   if (!mInputEvtQ) return;
   mInputEvtQ->sync([this] {
     mXPCEventConnection.reset();
+    mPeers.reset();
     mBSMReadSource.reset();  // closes the pipe
   });
   // Every event already read on the input queue has been dispatched once this returns.
@@ -139,22 +135,21 @@ void Monitor::resume() {
 }
 
 void Monitor::applyBackPressure() {
-  if (!mHooks.backlog || !mInputEvtQ || !mInputEvtQ->isCurrentThread()) return;
+  if (!mHooks.backlog || !mProgressSource || !mInputEvtQ->isCurrentThread()) return;
   if (!mInputEvtQ->readGateOpen() || mHooks.backlog() <= kBackPressureHighJobs) return;
   mInputEvtQ->setReadGateOpen(false);
-  watchBacklog();
+  mHooks.signalWhenBacklogAtMost(kBackPressureLowJobs);
 }
 
-void Monitor::watchBacklog() {
-  const bool scheduled = mInputEvtQ->callLater(kBacklogPollMicroseconds, [this] {
-    if (mHooks.backlog() <= kBackPressureLowJobs) {
-      mInputEvtQ->setReadGateOpen(true);
-    } else {
-      watchBacklog();
-    }
-  });
-  // Without a timer the gate could never reopen: keep reading instead.
-  if (!scheduled) mInputEvtQ->setReadGateOpen(true);
+void Monitor::onBacklogProgress() {
+  uint64_t count = 0;
+  [[maybe_unused]] ssize_t n = read(mHooks.progressDescriptor, &count, sizeof count);
+  if (mInputEvtQ->readGateOpen()) return;
+  if (mHooks.backlog() <= kBackPressureLowJobs) {
+    mInputEvtQ->setReadGateOpen(true);
+  } else {
+    mHooks.signalWhenBacklogAtMost(kBackPressureLowJobs);
+  }
 }
 
 int Monitor::runAuditpipeListener() {

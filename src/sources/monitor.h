@@ -2,8 +2,8 @@
 // engine. It owns the input queue (a thread running its own event loop) on which the event
 // socket and the audit pipe deliver, and the sender filter.
 // Main thread: the constructor, setEventSocketPath, setEventFilterUID, beginListening,
-// stopListening, suspend, resume, setRulebase. Input queue: filterBySourceUID,
-// applyBackPressure. Any thread: processEvent, rulebase, getVariables.
+// stopListening, suspend, resume. Input queue: filterBySourceUID, applyBackPressure. Any
+// thread: processEvent.
 #pragma once
 
 #include <cstddef>
@@ -16,13 +16,13 @@
 #include <string>
 #include <string_view>
 
-#include "context/types.h"
 #include "plist/value.h"
 
 namespace tarvod {
 
 class EventLoop;
 class EventListener;
+class IoSource;
 class PeerConnections;
 class AuditReadSource;
 
@@ -33,13 +33,16 @@ using IdSet = std::set<int64_t>;
 // text. A lone comma therefore gives { 0 }.
 std::optional<IdSet> ParseFilterList(std::optional<std::string_view> text);
 
-// What the Monitor hands events to, and where it reads the rule engine's backlog. Tests
-// replace both; the two-argument constructor uses DispatchEvent and the processing queue.
+// What the Monitor hands events to, and how it watches the rule engine's backlog. Tests
+// replace them; EngineHooks (monitor_engine.h) wires them to an Engine.
 struct MonitorHooks {
-  std::function<void(const RulebasePtr&, const plist::Dictionary&, const VariableStorePtr&)>
-      dispatch;
+  std::function<void(const plist::Dictionary&)> dispatch;
   // Jobs waiting on the processing queue; empty: no back-pressure.
   std::function<size_t()> backlog;
+  // Asks for progressDescriptor to become readable once at most the given number of jobs
+  // wait. With backlog, both must be set.
+  std::function<void(size_t)> signalWhenBacklogAtMost;
+  int progressDescriptor = -1;
 };
 
 // While more jobs than kBackPressureHighJobs wait on the processing queue, the input queue
@@ -51,9 +54,7 @@ inline constexpr size_t kBackPressureLowJobs = 512;
 
 class Monitor {
  public:
-  // initWithRulebase:andVariables: wired to the rule engine (DispatchEvent, ProcessingQueue).
-  Monitor(RulebasePtr rulebase, VariableStorePtr variables);
-  Monitor(RulebasePtr rulebase, VariableStorePtr variables, MonitorHooks hooks);
+  explicit Monitor(MonitorHooks hooks);
   // Stops every source and the input queue.
   ~Monitor();
   Monitor(const Monitor&) = delete;
@@ -68,37 +69,33 @@ class Monitor {
   // A blocking reader of mAuditpipe that the daemon does not use; returns the error number
   // that ended it, or -1 when it could not start.
   int runAuditpipeListener();
-  VariableStorePtr getVariables() const { return mVariables; }
-  RulebasePtr rulebase() const;
-  // The reload's one indivisible replacement of the rulebase.
-  void setRulebase(RulebasePtr rulebase);
   void processEvent(const plist::Dictionary& event);
   bool filterBySourceUID(uint32_t uid, uint32_t gid) const;
   void resume();
   void suspend();
-  // Stops the listener and the audit source, then drains the input queue: every event
-  // already read has been dispatched when it returns.
+  // Stops the listener, every accepted connection and the audit source, then drains the
+  // input queue: every event already read has been dispatched when it returns, and none
+  // is read afterwards.
   void stopListening();
   void beginListening();
   void setEventFilterUID(std::optional<IdSet> uids, std::optional<IdSet> gids);
 
   // After each event a socket or the pipe delivered: closes the input queue's read gate
-  // while the processing queue is over its limit, and opens it again once it has drained.
+  // while the processing queue is over its limit; the queue's progress descriptor opens it
+  // again once the backlog is down to the low mark.
   void applyBackPressure();
   // The input queue; nullptr before the first beginListening.
   EventLoop* inputQueue() const { return mInputEvtQ.get(); }
 
  private:
-  void watchBacklog();
+  void onBacklogProgress();
 
-  mutable std::mutex mRulebaseLock;  // guards the reference only
-  RulebasePtr mRulebase;
-  VariableStorePtr mVariables;
   std::unique_ptr<EventListener> mXPCEventConnection;
   std::unique_ptr<EventLoop> mInputEvtQ;
   int mAuditpipe = -1;
   uint64_t mEventBufferSize = 0;
   std::unique_ptr<AuditReadSource> mBSMReadSource;
+  std::unique_ptr<IoSource> mProgressSource;
   std::optional<IdSet> mAllowedUIDs;
   std::optional<IdSet> mAllowedGIDs;
 

@@ -1,13 +1,15 @@
-// The Monitor's connection to the rule engine, kept apart so that the sources can be built
-// and tested without it.
-#include "engine/dispatch.h"
-#include "engine/keyword_tables.h"
-#include "sources/monitor.h"
+#include "sources/monitor_engine.h"
 
 namespace tarvod {
 
-Monitor::Monitor(RulebasePtr rulebase, VariableStorePtr variables)
-    : Monitor(std::move(rulebase), std::move(variables),
-              MonitorHooks{DispatchEvent, [] { return ProcessingQueue().pending(); }}) {}
+MonitorHooks EngineHooks(Engine& engine) {
+  SerialQueue& queue = engine.queue();
+  return MonitorHooks{
+      [&engine](const plist::Dictionary& event) { engine.dispatchEvent(event); },
+      [&queue] { return queue.pending(); },
+      [&queue](size_t limit) { queue.signalWhenPendingAtMost(limit); },
+      queue.progressDescriptor(),
+  };
+}
 
 }  // namespace tarvod

@@ -12,6 +12,9 @@
 #include <string_view>
 #include <vector>
 
+#include <sys/eventfd.h>
+#include <unistd.h>
+
 #include "platform/seqpacket.h"
 #include "sources/monitor.h"
 
@@ -19,17 +22,31 @@ namespace tarvod::testing {
 
 class EventCollector {
  public:
-  // Dispatch into this collector; backlog, when given, is read as the processing queue's.
-  MonitorHooks hooks(std::atomic<size_t>* backlog = nullptr) {
+  EventCollector() : mProgressFd(eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)) {}
+  ~EventCollector() { close(mProgressFd); }
+
+  // Dispatch into this collector; with backPressure, the backlog is the one setBacklog sets.
+  MonitorHooks hooks(bool backPressure = false) {
     MonitorHooks h;
-    h.dispatch = [this](const RulebasePtr&, const plist::Dictionary& event,
-                        const VariableStorePtr&) {
+    h.dispatch = [this](const plist::Dictionary& event) {
       std::lock_guard<std::mutex> lock(mLock);
       mEvents.push_back(event);
       mChanged.notify_all();
     };
-    if (backlog != nullptr) h.backlog = [backlog] { return backlog->load(); };
+    if (backPressure) {
+      h.backlog = [this] { return mBacklog.load(); };
+      h.signalWhenBacklogAtMost = [this](size_t limit) {
+        mSignalLimit = limit;
+        signalIfDue();
+      };
+      h.progressDescriptor = mProgressFd;
+    }
     return h;
+  }
+  // The pretended processing backlog; signals progress the way the processing queue does.
+  void setBacklog(size_t backlog) {
+    mBacklog = backlog;
+    signalIfDue();
   }
   bool waitFor(size_t count, std::chrono::seconds timeout = std::chrono::seconds(10)) {
     std::unique_lock<std::mutex> lock(mLock);
@@ -44,7 +61,21 @@ class EventCollector {
     return mEvents.size();
   }
 
+  size_t backlogSignalLimit() const { return mSignalLimit; }
+
  private:
+  void signalIfDue() {
+    const size_t limit = mSignalLimit.load();
+    if (limit != kNoLimit && mBacklog.load() <= limit) {
+      mSignalLimit = kNoLimit;
+      const uint64_t one = 1;
+      [[maybe_unused]] ssize_t n = write(mProgressFd, &one, sizeof one);
+    }
+  }
+  static constexpr size_t kNoLimit = ~size_t{0};
+  int mProgressFd;
+  std::atomic<size_t> mBacklog{0};
+  std::atomic<size_t> mSignalLimit{kNoLimit};
   std::mutex mLock;
   std::condition_variable mChanged;
   std::vector<plist::Dictionary> mEvents;

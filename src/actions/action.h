@@ -1,0 +1,37 @@
+// The action handlers behind the action keywords. Each handler is one object behind this
+// interface, one file each; a handler runs on the processing queue for a rule that fired, and
+// its failures are logged and end only that action.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "context/context.h"
+#include "plist/value.h"
+
+namespace tarvod {
+
+// The rule an action belongs to, with the keys every handler needs read once.
+struct FiredRule {
+  const Rule& rule;
+  std::string name;      // "(null)" when the rule has none
+  std::string filePath;  // empty when the rule has none
+};
+
+class Action {
+ public:
+  virtual ~Action() = default;
+  virtual void perform(const plist::Dictionary& action, const FiredRule& rule,
+                       Context& context) = 0;
+};
+
+// The text form of action[key] after substitution. The outer nullopt means "stop the action":
+// the substitution failed and "Error: %s" was logged at level 0. An absent key, or a
+// reference to nothing, gives an absent text.
+std::optional<std::optional<std::string>> ResolveActionText(const plist::Dictionary& action,
+                                                            std::string_view key,
+                                                            const FiredRule& rule,
+                                                            Context& context);
+
+}  // namespace tarvod

@@ -1,0 +1,156 @@
+#include "engine/engine.h"
+
+#include <atomic>
+#include <filesystem>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "context/context.h"
+#include "engine/event_record.h"
+#include "engine/keyword_tables.h"
+#include "engine/rule_processor.h"
+#include "engine/rules_loader.h"
+#include "platform/diagnostic_log.h"
+
+namespace tarvod {
+namespace {
+
+// The prefixes of a type, longest first: "a.b.c", "a.b", "a". Empty components count, so
+// "a..b" yields "a..b", "a.", "a".
+std::vector<std::string> TypePrefixes(const std::string& type) {
+  std::vector<std::string> prefixes{type};
+  for (size_t dot = type.rfind('.'); dot != std::string::npos;
+       dot = dot == 0 ? std::string::npos : type.rfind('.', dot - 1)) {
+    prefixes.push_back(type.substr(0, dot));
+  }
+  return prefixes;
+}
+
+void QueuePrefix(SerialQueue& queue, double now, const std::string& prefix,
+                 const RulebaseEntry& entry, const std::shared_ptr<const plist::Dictionary>& event,
+                 const RulebasePtr& rulebase, const VariableStorePtr& variables) {
+  LogMessage(2, "  Processing event: %s", prefix.c_str());
+  auto context = std::make_shared<Context>(variables, rulebase, *event);
+
+  // The counter runs in the rulebase entry, so "prefix:eventCounter" counts the events of
+  // this prefix since the rules were loaded (a reload starts a new rulebase at 0); the
+  // context's copy is the count including this event.
+  const uint64_t count = entry.eventCounter.fetch_add(1, std::memory_order_relaxed) + 1;
+  entry.lastEventTimestamp.store(now, std::memory_order_relaxed);
+  context->eventMetadata().set(prefix + ":eventCounter",
+                               plist::Value::Integer(static_cast<int64_t>(count)));
+  context->eventMetadata().set(prefix + ":lastEventTimestamp", plist::Value::Real(now));
+
+  // Each job holds its own reference to its rule; the context keeps the rulebase alive.
+  const std::vector<RulePtr>& rules = entry.rules;
+  auto fired = std::make_shared<std::atomic<bool>>(false);
+  for (const RulePtr& rule : rules) {
+    queue.async([rule, context, fired] {
+      if (ProcessRule(*rule, *context)) fired->store(true);
+    });
+  }
+  // On the serial queue the record job runs after every rule job queued above, which is the
+  // wait on the prefix's rule jobs.
+  const bool hasRules = !rules.empty();
+  queue.async(
+      [event, fired, hasRules] { WriteEventRecord(*event, hasRules, hasRules && !fired->load()); });
+}
+
+}  // namespace
+
+std::string PathExtension(std::string path) {
+  while (path.size() > 1 && path.back() == '/') path.pop_back();
+  const std::string name = std::filesystem::path(path).filename().string();
+  const size_t dot = name.rfind('.');
+  if (dot == std::string::npos || dot == 0 || dot + 1 == name.size()) return "";
+  return name.substr(dot + 1);
+}
+
+Engine::Engine(const Clock& clock, plist::Dictionary globals)
+    : mClock(clock),
+      mQueue(std::make_unique<SerialQueue>("com.quenta.tarvod.processq")),
+      mVariables(std::make_shared<VariableStore>()),
+      mRulebase(std::make_shared<const Rulebase>()) {
+  BuildKeywordTables();
+  mVariables->set(kGlobalsKey, plist::Value(std::move(globals)));
+}
+
+Engine::~Engine() {
+  if (mAbandoned) {
+    // A job may still be stuck in a blocking call: joining its thread would hang the exit.
+    // The queue stays reachable, and the process ends around it.
+    static std::vector<std::unique_ptr<SerialQueue>> stuck;
+    stuck.push_back(std::move(mQueue));
+  }
+}
+
+void Engine::dispatchEvent(const plist::Dictionary& event) {
+  if (!mDispatchOpen.load()) return;
+  const plist::Value* typeValue = event.find("eventType");
+  if (typeValue == nullptr) return;
+  LogEvent(event);
+  const std::string type = typeValue->textForm();
+  LogMessage(1, "EVENT RECEIVED: %s", type.c_str());
+
+  const RulebasePtr rulebase = mRulebase.load();
+  const double now = mClock.now();
+  // One copy of the event, made when a prefix first has rules and shared by every record job
+  // of this dispatch.
+  std::shared_ptr<const plist::Dictionary> shared;
+  for (const std::string& prefix : TypePrefixes(type)) {
+    auto found = rulebase->find(prefix);
+    if (found != rulebase->end()) {
+      if (!shared) shared = std::make_shared<const plist::Dictionary>(event);
+      QueuePrefix(*mQueue, now, prefix, found->second, shared, rulebase, mVariables);
+      continue;
+    }
+    if (prefix.size() == type.size()) WriteEventRecord(event, false, false);
+    LogMessage(2, "  Dropping event %s because it has no associated rules", prefix.c_str());
+  }
+}
+
+plist::Dictionary Engine::daemonEvent(const char* type) const {
+  return plist::Dictionary{
+      {"eventType", plist::Value(type)},
+      {"eventTimestamp", plist::Value::Real(mClock.now())},
+      {"eventSource", plist::Value("tarvod")},
+  };
+}
+
+void Engine::postStartupEvent(bool reload) {
+  dispatchEvent(daemonEvent(reload ? "startup.reload" : "startup.load"));
+}
+
+void Engine::postShutdownEvent() { dispatchEvent(daemonEvent("shutdown")); }
+
+RulebasePtr Engine::loadRules(const std::string& path, size_t* count) {
+  auto rulebase = std::make_shared<Rulebase>();
+  size_t loaded = 0;
+  withVariables([&](VariableStore&) {
+    loaded = PathExtension(path).empty() ? LoadRulesDirectory(*rulebase, mVariables, path)
+                                         : LoadRulesFile(*rulebase, mVariables, path);
+  });
+  if (count) *count = loaded;
+  return rulebase;
+}
+
+void Engine::swapRulebase(RulebasePtr rulebase) {
+  mPreviousRulebase = mRulebase.exchange(std::move(rulebase));
+}
+
+bool Engine::withVariables(const std::function<void(VariableStore&)>& work) {
+  if (mAbandoned) return mQueue->runExclusive([&] { work(*mVariables); }, 1.0);
+  mQueue->sync([&] { work(*mVariables); });
+  return true;
+}
+
+size_t Engine::drain(double seconds) {
+  if (mQueue->drainFor(seconds)) return 0;
+  const size_t pending = mQueue->pending();
+  mQueue->abandon();
+  mAbandoned = true;
+  return pending;
+}
+
+}  // namespace tarvod

@@ -1,0 +1,73 @@
+// The rule engine: owns the processing queue "com.quenta.tarvod.processq", the current and
+// the previous rulebase and the variable store. dispatchEvent may be called from any thread
+// and never waits for rules: it queues one job per rule and one record job per matching type
+// prefix. Everything else is called from the main thread.
+#pragma once
+
+#include <atomic>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "context/types.h"
+#include "platform/clock.h"
+#include "platform/serial_queue.h"
+#include "plist/value.h"
+
+namespace tarvod {
+
+class Engine {
+ public:
+  // The store starts as { _globals = globals }; the rulebase starts empty.
+  Engine(const Clock& clock, plist::Dictionary globals);
+  // Runs the jobs still queued, unless the queue was abandoned with a job stuck.
+  ~Engine();
+  Engine(const Engine&) = delete;
+  Engine& operator=(const Engine&) = delete;
+
+  void dispatchEvent(const plist::Dictionary& event);
+  // "startup.load" (or "startup.reload" when reload is true) and "shutdown", from "tarvod".
+  void postStartupEvent(bool reload);
+  void postShutdownEvent();
+
+  // Reads the rules at path (one file when its last component has an extension, else the
+  // whole tree) into a new rulebase, on the queue, since "eval on load" variables write the
+  // store. *count receives the number of rules loaded.
+  RulebasePtr loadRules(const std::string& path, size_t* count);
+  // The rulebase events are dispatched against.
+  RulebasePtr rulebase() const { return mRulebase.load(); }
+  // One indivisible exchange: an event dispatched meanwhile sees the whole old rulebase or the
+  // whole new one. The replaced rulebase stays alive as the previous one until the next swap.
+  void swapRulebase(RulebasePtr rulebase);
+
+  // Runs work with the store on the processing queue, after the jobs queued before it, and
+  // waits. Once the queue has been abandoned, runs it on the calling thread as soon as no job
+  // holds the store (a stuck job waits in a blocking section); false when that cannot be had
+  // within a second.
+  bool withVariables(const std::function<void(VariableStore&)>& work);
+
+  // Events dispatched from now on are dropped: nothing reaches rules after the sources stop.
+  void closeDispatch() { mDispatchOpen.store(false); }
+  // Waits up to seconds for the queued jobs. Returns 0 when they all ran; otherwise abandons
+  // the queue (jobs not started are dropped, the running one is left to finish or hang) and
+  // returns how many jobs were still pending.
+  size_t drain(double seconds);
+
+  SerialQueue& queue() { return *mQueue; }
+
+ private:
+  plist::Dictionary daemonEvent(const char* type) const;
+
+  const Clock& mClock;
+  std::unique_ptr<SerialQueue> mQueue;
+  VariableStorePtr mVariables;
+  std::atomic<RulebasePtr> mRulebase;
+  RulebasePtr mPreviousRulebase;  // main thread only
+  std::atomic<bool> mDispatchOpen{true};
+  bool mAbandoned = false;
+};
+
+// The extension of a path's last component ("rules.plist" -> "plist", "rules/" -> "").
+std::string PathExtension(std::string path);
+
+}  // namespace tarvod

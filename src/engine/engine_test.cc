@@ -1,0 +1,155 @@
+// The Engine: rules of events dispatched from several threads take turns on the processing
+// queue (were two ever to run at once, updates of the shared global would be lost and
+// ThreadSanitizer, which runs this test, would report it), a rulebase swapped during dispatch
+// is seen whole, and a drain that times out still lets the store be reached.
+
+#include "engine/engine.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <thread>
+
+#include "platform/structured_log.h"
+#include "platform/testing/fake_clock.h"
+#include "platform/testing/json_lines.h"
+#include "platform/testing/log_capture.h"
+
+namespace tarvod {
+namespace {
+
+using plist::Array;
+using plist::Dictionary;
+using plist::Value;
+
+RulePtr CountingRule(const char* name, Dictionary extra = {}) {
+  Dictionary rule{
+      {"name", name},
+      {"filePath", "/rules/count.plist"},
+      {"criterion", Array{Value(Dictionary{{"operator", "true"}})}},
+      {"variables", Dictionary{{"global:count", "${global:count} + 1"}}},
+  };
+  for (auto& [key, value] : extra) rule.set(key, value);
+  return std::make_shared<const Rule>(std::move(rule));
+}
+
+int64_t Count(Engine& engine) {
+  int64_t count = -1;
+  engine.withVariables([&](VariableStore& store) {
+    count = store.findDictionary(kGlobalsKey)->find("count")->integerValue();
+  });
+  return count;
+}
+
+class EngineTest : public ::testing::Test {
+ protected:
+  void SetUp() override { ConfigureStructuredLog(records_); }
+  void TearDown() override { ConfigureStructuredLog(""); }
+
+  testing::LogCapture capture_{0};
+  const std::string records_ = capture_.directory() + "/records.jsonl";
+  FakeClock clock_{1000};
+  Engine engine_{clock_, Dictionary{{"count", Value::Integer(0)}}};
+};
+
+TEST_F(EngineTest, EventsFromTwoThreadsNeverRunRulesAtTheSameTime) {
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)["tick"].rules = {CountingRule("first"), CountingRule("second")};
+  (*rulebase)["tick.fast"].rules = {CountingRule("third")};
+  engine_.swapRulebase(rulebase);
+
+  constexpr int kEventsPerThread = 150;
+  const auto sender = [&](const char* type) {
+    for (int i = 0; i < kEventsPerThread; ++i) engine_.dispatchEvent({{"eventType", type}});
+  };
+  std::thread timer(sender, "tick");
+  std::thread input(sender, "tick.fast");
+  timer.join();
+  input.join();
+
+  // tick runs two rules; tick.fast runs its own and then tick's two.
+  EXPECT_EQ(Count(engine_), kEventsPerThread * 2 + kEventsPerThread * 3);
+  EXPECT_EQ(rulebase->at("tick").eventCounter.load(), 2u * kEventsPerThread);
+  EXPECT_EQ(rulebase->at("tick.fast").eventCounter.load(), 1u * kEventsPerThread);
+  EXPECT_EQ(rulebase->at("tick").lastEventTimestamp.load(), 1000.0);
+  // One record per tick event and two per tick.fast event, none blocked.
+  const auto written = testing::ReadJsonRecords(records_);
+  EXPECT_EQ(written.size(), 3u * kEventsPerThread);
+  for (const auto& record : written) EXPECT_EQ(record.attribute("eventBlocked"), "false");
+  EXPECT_EQ(capture_.text(), "");
+}
+
+TEST_F(EngineTest, EveryEventSeesAWholeRulebaseWhileRulebasesAreSwapped) {
+  const auto makeRulebase = [] {
+    auto rulebase = std::make_shared<Rulebase>();
+    (*rulebase)["tick"].rules = {CountingRule("count")};
+    return rulebase;
+  };
+  engine_.swapRulebase(makeRulebase());
+  constexpr int kEvents = 3000;
+  std::thread sender([&] {
+    for (int i = 0; i < kEvents; ++i) engine_.dispatchEvent({{"eventType", "tick"}});
+  });
+  for (int i = 0; i < 200; ++i) engine_.swapRulebase(makeRulebase());
+  sender.join();
+  EXPECT_EQ(Count(engine_), kEvents);
+}
+
+TEST_F(EngineTest, EventsAfterCloseDispatchReachNoRule) {
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)["tick"].rules = {CountingRule("count")};
+  engine_.swapRulebase(rulebase);
+  engine_.dispatchEvent({{"eventType", "tick"}});
+  engine_.closeDispatch();
+  engine_.dispatchEvent({{"eventType", "tick"}});
+  EXPECT_EQ(engine_.drain(10), 0u);
+  EXPECT_EQ(Count(engine_), 1);
+  EXPECT_EQ(testing::ReadJsonRecords(records_).size(), 1u);
+}
+
+TEST_F(EngineTest, ADrainThatTimesOutDropsTheRestAndStillReachesTheStore) {
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)["tick"].rules = {CountingRule("count")};
+  engine_.swapRulebase(rulebase);
+  engine_.dispatchEvent({{"eventType", "tick"}});
+  // An action stuck in a blocking call, as a write to a file nobody drains would be.
+  std::atomic<bool> release{false};
+  engine_.queue().async([&] {
+    SerialQueue::BlockingSection blocking;
+    while (!release.load()) usleep(1000);
+  });
+  for (int i = 0; i < 5; ++i) engine_.dispatchEvent({{"eventType", "tick"}});
+
+  EXPECT_EQ(engine_.drain(0.2), 11u);  // the stuck job, five rules and their records
+  int64_t count = -1;
+  EXPECT_TRUE(engine_.withVariables([&](VariableStore& store) {
+    count = store.findDictionary(kGlobalsKey)->find("count")->integerValue();
+  }));
+  EXPECT_EQ(count, 1);
+
+  // The stuck job finishes; the dropped jobs never run.
+  release = true;
+  usleep(50'000);
+  EXPECT_EQ(Count(engine_), 1);
+  EXPECT_EQ(engine_.queue().pending(), 0u);
+}
+
+TEST_F(EngineTest, EmptyComponentsOfATypeArePrefixesAndATypelessEventLeavesNoTrace) {
+  SetDebugLevel(2);
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)["a."].rules = {CountingRule("a dot")};
+  (*rulebase)[""].rules = {CountingRule("empty type")};
+  engine_.swapRulebase(rulebase);
+  engine_.dispatchEvent({{"eventDetails", Dictionary{{"a", "b"}}}});
+  engine_.dispatchEvent({{"eventType", "a..b"}});
+  EXPECT_EQ(Count(engine_), 1);
+  const std::string log = capture_.text();
+  EXPECT_TRUE(testing::LinesInOrder(
+      log, {"  Dropping event a..b because it has no associated rules\n",
+            "  Processing event: a.\n", "  Dropping event a because it has no associated rules\n"}))
+      << log;
+  EXPECT_EQ(testing::ReadJsonRecords(records_).size(), 2u);
+}
+
+}  // namespace
+}  // namespace tarvod

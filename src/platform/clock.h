@@ -1,0 +1,25 @@
+// The clock: wall time for timestamps and dates, monotonic time for deadlines. The system
+// clock may be used from any thread; tests pass a FakeClock (src/platform/testing).
+#pragma once
+
+#include <string>
+
+namespace tarvod {
+
+class Clock {
+ public:
+  virtual ~Clock() = default;
+  // Seconds since 2001-01-01 00:00:00 UTC, the reference date of every timestamp.
+  virtual double now() const = 0;
+  // Seconds on a clock that never goes back; only differences mean anything.
+  virtual double monotonic() const = 0;
+
+  // The host's clock; lives as long as the process.
+  static Clock& System();
+};
+
+// The local date and time of now() in the calendar-date text form of the start and stop
+// messages: "2026-12-06 13:14:03 +0100".
+std::string LocalDateText(const Clock& clock);
+
+}  // namespace tarvod
