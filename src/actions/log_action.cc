@@ -136,8 +136,7 @@ void BuildLevelNameTable() {
   });
 }
 
-void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule,
-                        Context& context) {
+void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule, Context& context) {
   const auto resolvedMessage = ResolveActionText(action, "message", rule, context);
   if (!resolvedMessage) return;
   if (!*resolvedMessage || (*resolvedMessage)->empty()) return;

@@ -58,7 +58,8 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   InstallSignalHandlers();
   const std::optional<Options> options = ParseOptions(argc, argv);
   if (!options) {
-    std::fprintf(stderr, "Usage: %s [ -r <rules.plist>] [-c <config file> ] [-v <debug level>] [-n]\n",
+    std::fprintf(stderr,
+                 "Usage: %s [ -r <rules.plist>] [-c <config file> ] [-v <debug level>] [-n]\n",
                  argv[0]);
     return 255;
   }

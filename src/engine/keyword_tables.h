@@ -5,7 +5,6 @@
 #include <optional>
 #include <string_view>
 
-
 namespace tarvod {
 
 void BuildKeywordTables();

@@ -94,8 +94,9 @@ size_t LoadRulesDirectory(Rulebase& rulebase, const VariableStorePtr& variables,
          it.increment(error)) {
       entries.push_back(*it);
     }
-    std::sort(entries.begin(), entries.end(),
-              [](const auto& a, const auto& b) { return a.path().filename() < b.path().filename(); });
+    std::sort(entries.begin(), entries.end(), [](const auto& a, const auto& b) {
+      return a.path().filename() < b.path().filename();
+    });
     std::vector<std::string> subdirectories;
     for (const fs::directory_entry& entry : entries) {
       std::string entryPath = directory;

@@ -31,7 +31,7 @@ template <typename T>
 class Result {
  public:
   Result(T value) : mValue(std::move(value)), mStatus(Status::Ok()) {}  // NOLINT: implicit
-  Result(Status status) : mStatus(std::move(status)) {}                // NOLINT: implicit
+  Result(Status status) : mStatus(std::move(status)) {}                 // NOLINT: implicit
 
   bool ok() const { return mValue.has_value(); }
   const Status& status() const { return mStatus; }

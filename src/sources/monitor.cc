@@ -30,8 +30,7 @@ std::optional<IdSet> ParseFilterList(std::optional<std::string_view> text) {
 }
 
 Monitor::Monitor(MonitorHooks hooks)
-    : mHooks(std::move(hooks)),
-      mEventSocketPath(kDefaultEventSocketPath) {}
+    : mHooks(std::move(hooks)), mEventSocketPath(kDefaultEventSocketPath) {}
 
 Monitor::~Monitor() {
   if (!mInputEvtQ) return;

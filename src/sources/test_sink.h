@@ -2,6 +2,7 @@
 // Test-only; the collector may be filled from the input queue while the test thread waits.
 #pragma once
 
+#include <sys/eventfd.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -11,9 +12,6 @@
 #include <string>
 #include <string_view>
 #include <vector>
-
-#include <sys/eventfd.h>
-#include <unistd.h>
 
 #include "platform/seqpacket.h"
 #include "sources/monitor.h"
