@@ -2,8 +2,14 @@
 // through the real binary's exit status and error log.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <unistd.h>
+
+#include <cstdio>
 
 #include "harness.h"
 #include "rules_xml.h"
@@ -189,6 +195,72 @@ TEST_F(DaemonTest, SigusrOneIsIgnored) {
   usleep(200 * 1000);
   EXPECT_TRUE(daemon.running());
   EXPECT_EQ(daemon.stop(SIGTERM), 0);
+}
+
+TEST_F(DaemonTest, SigtermAndSighupTogetherStopWithoutReloading) {
+  const std::string config = writeConfig();
+  Daemon daemon({"-c", config, "-r", writeOneRule(), "-v", "1"}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+  // Stopped, the daemon takes both signals at once when it continues.
+  kill(daemon.pid(), SIGSTOP);
+  kill(daemon.pid(), SIGHUP);
+  kill(daemon.pid(), SIGTERM);
+  kill(daemon.pid(), SIGCONT);
+  EXPECT_EQ(daemon.wait(), 0);
+  EXPECT_THAT(ReadFile(errorLog()), Not(HasSubstr("Reloading Rules")));
+}
+
+// File-local variables survive a restart; the shutdown rules run before the state is saved
+// and "Velkin Shutdown at" is the last line.
+TEST_F(DaemonTest, StateIsSavedAtShutdownAndRestoredAtTheNextStart) {
+  const std::string config =
+      writeConfig({{"saveState", "<true/>"}, {"stateDirectory", Str(dir.file("state"))}});
+  const std::string rules =
+      dir.write("rules.plist",
+                RulesDocument({testing::RuleXml("count", std::vector<std::string>{"startup.load"},
+                                                {{"variables", Dict({{"n", Str("${n} + 1")}})}}),
+                               testing::RuleXml("bye", std::vector<std::string>{"shutdown"},
+                                                {{"variables", Dict({{"bye", Str("yes")}})}})}));
+  for (int run = 1; run <= 2; ++run) {
+    std::remove(errorLog().c_str());
+    Daemon daemon({"-c", config, "-r", rules, "-v", "1"}, dir);
+    ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+    EXPECT_EQ(daemon.stop(), 0);
+    const std::string state = ReadFile(dir.file("state/state"));
+    EXPECT_THAT(state, HasSubstr("<key>n</key>\n\t\t<integer>" + std::to_string(run)));
+    EXPECT_THAT(state, HasSubstr("<key>bye</key>"));
+  }
+  EXPECT_TRUE(FileExists(dir.file("state/state_prev")));
+  const std::string log = ReadFile(errorLog());
+  EXPECT_LT(log.rfind("Saving the global state...\n"), log.rfind("Velkin Shutdown at "));
+  EXPECT_EQ(log.find('\n', log.rfind("Velkin Shutdown at ")), log.size() - 1);
+}
+
+TEST_F(DaemonTest, TellsTheServiceManagerWhenReadyReloadingAndStopping) {
+  const std::string socketPath = dir.file("notify");
+  const int listener = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", socketPath.c_str());
+  ASSERT_EQ(bind(listener, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  const auto next = [&] {
+    pollfd ready{listener, POLLIN, 0};
+    if (poll(&ready, 1, 10000) != 1) return std::string("(nothing)");
+    char buffer[256];
+    const ssize_t n = recv(listener, buffer, sizeof buffer, 0);
+    return std::string(buffer, n > 0 ? static_cast<size_t>(n) : 0);
+  };
+  setenv("NOTIFY_SOCKET", socketPath.c_str(), 1);
+  Daemon daemon({"-c", writeConfig(), "-r", writeOneRule()}, dir);
+  unsetenv("NOTIFY_SOCKET");
+  EXPECT_EQ(next(), "READY=1");
+  kill(daemon.pid(), SIGHUP);
+  EXPECT_EQ(next(), "RELOADING=1");
+  EXPECT_EQ(next(), "READY=1");
+  kill(daemon.pid(), SIGTERM);
+  EXPECT_EQ(next(), "STOPPING=1");
+  EXPECT_EQ(daemon.wait(), 0);
+  close(listener);
 }
 
 // The fixed log directory is checked only inside a private mount namespace with a tmpfs over

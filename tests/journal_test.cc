@@ -8,10 +8,14 @@
 #include <sched.h>
 #include <signal.h>
 #include <sys/mount.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
+#include <cstdio>
 #include <string>
 #include <vector>
 
@@ -187,6 +191,43 @@ TEST_F(JournalTest, AnUnreachableJournalCostsEachRecordAMessageAndNothingElse) {
   EXPECT_EQ(count("Failed to log event startup.load to KVLOG tarvod database\n"), 2u);
   EXPECT_EQ(count("Failed to log event shutdown to KVLOG tarvod database\n"), 1u);
   EXPECT_THAT(log, HasSubstr("Velkin Shutdown at"));
+}
+
+// A journal that takes no more records: a socket at the journal's address that nobody
+// reads, so that sending a record blocks the rule job for good once its queue is full. The
+// daemon must still stop within shutdownTimeout, report what it dropped and save its state.
+TEST_F(JournalTest, AStopEndsInTimeWhileARuleIsStuck) {
+  unlink(kSocket);
+  const int stuck = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", kSocket);
+  ASSERT_EQ(bind(stuck, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  const std::string config =
+      dir.write("tarvod.plist", ConfigPlist({{"errorLogPath", Str(errorLog)},
+                                             {"eventSocketPath", Str(dir.file("evtq"))},
+                                             {"saveState", "<true/>"},
+                                             {"stateDirectory", Str(dir.file("state"))},
+                                             {"shutdownTimeout", "<integer>1</integer>"}}));
+  // Every type has rules, so every record is written by a rule job, never by a sender.
+  const std::string rules = dir.write(
+      "rules.plist", RulesDocument({RuleXml("count", {"tick", "shutdown", "startup"},
+                                            {{"variables", Dict({{"n", Str("${n} + 1")}})}})}));
+  Daemon daemon({"-c", config, "-r", rules, "-v", "1"}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog, "Registered"));
+  for (int i = 0; i < 300; ++i) {
+    RunProgram({TarvodctlBinary(), "send", "--socket", dir.file("evtq"), "tick"});
+    if (ReadFile(errorLog).find("EVENT RECEIVED: tick") != std::string::npos && i > 50) break;
+  }
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_EQ(daemon.stop(SIGTERM, 10s), 0);
+  EXPECT_LT(std::chrono::steady_clock::now() - start, 2500ms);
+  const std::string log = ReadFile(errorLog);
+  EXPECT_THAT(log, HasSubstr("rule jobs still pending after 1 seconds"));
+  EXPECT_EQ(log.find('\n', log.rfind("Velkin Shutdown at ")), log.size() - 1);
+  EXPECT_THAT(ReadFile(dir.file("state/state")), HasSubstr("<key>n</key>"));
+  close(stuck);
+  unlink(kSocket);
 }
 
 }  // namespace

@@ -3,6 +3,7 @@
 // senders (the event socket then stops reading and senders wait in the kernel).
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -31,6 +32,10 @@ constexpr bool kMeasuresOwnMemory = false;
 #else
 constexpr bool kMeasuresOwnMemory = true;
 #endif
+
+std::string EventPlist(const char* type, const std::string& n) {
+  return PlistDocument(Dict({{"eventType", Str(type)}, {"eventDetails", Dict({{"n", Str(n)}})}}));
+}
 
 size_t CountLines(const std::string& path) {
   if (!FileExists(path)) return 0;
@@ -104,6 +109,73 @@ TEST(Load, EveryEventOfEightConcurrentSendersIsCountedInBoundedMemory) {
   if (kMeasuresOwnMemory) {
     EXPECT_LT(std::max(hwm, peakKb.load()), kResidentBoundKb);
   }
+  EXPECT_EQ(daemon.stop(), 0);
+}
+
+// SIGHUP twenty times while eight senders flood: no event is lost or counted twice, each
+// reload is one reload, and the rules read by the last one are the ones that run.
+TEST(Load, ReloadsUnderLoadLoseNoEventAndSwapInTheNewRules) {
+  constexpr int kReloads = 20;
+  constexpr int kEventsEach = 4'000;
+  TempDir dir;
+  const std::string socketPath = dir.file("run/evtq");
+  const std::string counted = dir.file("counted.log");
+  const std::string config =
+      dir.write("tarvod.plist", ConfigPlist({{"errorLogPath", Str(dir.file("error.log"))},
+                                             {"structuredLogPath", Str(dir.file("records.jsonl"))},
+                                             {"eventSocketPath", Str(socketPath)}}));
+  const auto writeRules = [&](int generation) {
+    const std::string g = std::to_string(generation);
+    dir.write(
+        "rules/r.plist",
+        RulesDocument({RuleXml("count", {"load"},
+                               {{"actions", Arr({FileLog("g" + g + " ${event:n}", counted)})}}),
+                       RuleXml("mark", {"startup.reload"},
+                               {{"actions", Arr({FileLog("reload " + g, counted)})}})}));
+  };
+  writeRules(0);
+  Daemon daemon({"-c", config, "-r", dir.file("rules"), "-n", "-v", "1"}, dir);
+  ASSERT_TRUE(daemon.waitForLine(dir.file("error.log"), "Registered"));
+
+  std::atomic<int> failures{0};
+  std::vector<std::thread> senders;
+  for (int s = 0; s < kSenders; ++s) {
+    senders.emplace_back([&, s] {
+      const SocketResult connection = ConnectSeqpacket(socketPath);
+      std::string error;
+      for (int i = 0; i < kEventsEach && connection.fd >= 0; ++i) {
+        if (!SendPacket(connection.fd,
+                        EventPlist("load", std::to_string(s) + "-" + std::to_string(i)), &error)) {
+          ++failures;
+          break;
+        }
+      }
+      if (connection.fd < 0) ++failures;
+      close(connection.fd);
+    });
+  }
+  for (int g = 1; g <= kReloads; ++g) {
+    writeRules(g);
+    kill(daemon.pid(), SIGHUP);
+    ASSERT_TRUE(daemon.waitForLine(counted, "reload " + std::to_string(g) + "\n", 60s)) << g;
+  }
+  for (auto& t : senders) t.join();
+  ASSERT_EQ(failures, 0);
+  const SocketResult last = ConnectSeqpacket(socketPath);
+  std::string error;
+  ASSERT_TRUE(SendPacket(last.fd, EventPlist("load", "final"), &error));
+  close(last.fd);
+  ASSERT_TRUE(daemon.waitForLine(counted, " final\n", 120s));
+
+  const std::string text = ReadFile(counted);
+  EXPECT_EQ(CountLines(counted), static_cast<size_t>(kSenders * kEventsEach + kReloads + 1));
+  EXPECT_NE(text.find("g" + std::to_string(kReloads) + " final\n"), std::string::npos);
+  size_t reloads = 0;
+  for (size_t at = text.find("reload "); at != std::string::npos;
+       at = text.find("reload ", at + 1)) {
+    ++reloads;
+  }
+  EXPECT_EQ(reloads, static_cast<size_t>(kReloads));
   EXPECT_EQ(daemon.stop(), 0);
 }
 

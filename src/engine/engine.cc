@@ -53,8 +53,12 @@ void QueuePrefix(SerialQueue& queue, double now, const std::string& prefix,
   // On the serial queue the record job runs after every rule job queued above, which is the
   // wait on the prefix's rule jobs.
   const bool hasRules = !rules.empty();
-  queue.async(
-      [event, fired, hasRules] { WriteEventRecord(*event, hasRules, hasRules && !fired->load()); });
+  queue.async([event, fired, hasRules] {
+    // The record touches no variable: a journal that stops taking records must not keep
+    // shutdown from saving the store.
+    SerialQueue::BlockingSection blocking;
+    WriteEventRecord(*event, hasRules, hasRules && !fired->load());
+  });
 }
 
 }  // namespace
@@ -80,8 +84,8 @@ Engine::~Engine() {
   if (mAbandoned) {
     // A job may still be stuck in a blocking call: joining its thread would hang the exit.
     // The queue stays reachable, and the process ends around it.
-    static std::vector<std::unique_ptr<SerialQueue>> stuck;
-    stuck.push_back(std::move(mQueue));
+    static auto* const stuck = new std::vector<std::unique_ptr<SerialQueue>>;
+    stuck->push_back(std::move(mQueue));
   }
 }
 
