@@ -125,19 +125,6 @@ TEST_F(DaemonTest, SymbolicLinkAtTheErrorLogPathIsRefusedAndHardLinkAccepted) {
   EXPECT_EQ(ReadFile(target).rfind("existing\n", 0), 0u);
 }
 
-TEST_F(DaemonTest, LongMessagesAreCutTo2047BytesAndOneNewline) {
-  const std::string longName(3000, 'n');
-  const std::string rules = dir.write(
-      "rules.plist", RulesDocument({RuleXml(longName, "<array><string>x</string></array>")}));
-  const std::string config = writeConfig({{"debugLevel", "<integer>3</integer>"}});
-  Daemon daemon({"-c", config, "-r", rules}, dir);
-  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
-  EXPECT_EQ(daemon.stop(), 0);
-  const std::string log = ReadFile(errorLog());
-  const std::string expected = "  Added rule: " + longName.substr(0, 2047 - 14) + "\n";
-  EXPECT_THAT(log, HasSubstr("\n" + expected));
-}
-
 TEST_F(DaemonTest, RulesTreeLoadsEveryRulesFileAtAnyDepth) {
   const std::string types = "<array><string>a.b</string></array>";
   dir.write("tree/one.plist", RulesDocument({RuleXml("one", types)}));
