@@ -8,14 +8,17 @@
 #include <sched.h>
 #include <signal.h>
 #include <sys/mount.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
+#include <systemd/sd-journal.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <cstdio>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -228,6 +231,76 @@ TEST_F(JournalTest, AStopEndsInTimeWhileARuleIsStuck) {
   EXPECT_THAT(ReadFile(dir.file("state/state")), HasSubstr("<key>n</key>"));
   close(stuck);
   unlink(kSocket);
+}
+
+// Writes one journal entry as a process whose command name is comm, running as uid, and
+// stays alive until journald has read its name.
+void SendAs(const char* comm, uid_t uid, const std::string& message,
+            const char* identifier = "sshd") {
+  const pid_t child = fork();
+  if (child == 0) {
+    prctl(PR_SET_NAME, comm);
+    if (uid != 0 && setuid(uid) != 0) _exit(1);
+    sd_journal_send("MESSAGE=%s", message.c_str(), "SYSLOG_IDENTIFIER=%s", identifier, nullptr);
+    usleep(300'000);
+    _exit(0);
+  }
+  waitpid(child, nullptr, 0);
+}
+
+class SshJournalTest : public JournalTest {
+ protected:
+  void start() {
+    const std::string config = dir.write(
+        "tarvod.plist", ConfigPlist({{"errorLogPath", Str(errorLog)},
+                                     {"eventSocketPath", Str(dir.file("evtq"))},
+                                     {"structuredLogPath", Str(dir.file("records.jsonl"))},
+                                     {"stateDirectory", Str(dir.file("state"))}}));
+    const std::string rules = dir.write(
+        "rules.plist",
+        RulesDocument({RuleXml(
+            "ssh", {"auth"},
+            {{"actions", Arr({FileLog("${event:eventType}|${event:clientIP}|${event:username}|"
+                                      "${event:eventSource}",
+                                      out)})}})}));
+    daemon = std::make_unique<Daemon>(
+        std::vector<std::string>{"-c", config, "-r", rules, "-v", "1", "-n"}, dir);
+    ASSERT_TRUE(daemon->waitForLine(errorLog, "Registered"));
+  }
+
+  std::unique_ptr<Daemon> daemon;
+};
+
+TEST_F(SshJournalTest, RootSshdLinesBecomeLoginEventsAndForgedOnesNothing) {
+  Journald journald;
+  ASSERT_TRUE(journald.ready());
+  SendAs("sshd", 0, "Server listening on 0.0.0.0 port 22.");  // before the daemon: not replayed
+  SendAs("sshd", 0, "Accepted password for early from 192.0.2.1 port 1 ssh2");
+  start();
+  SendAs("sshd", 0, "Accepted publickey for alice from 192.0.2.7 port 51234 ssh2: ED25519 x");
+  SendAs("sshd-session", 0, "Failed password for invalid user bob from 2001:db8::1 port 2 ssh2");
+  SendAs("sshd", 0, "Invalid user x from 10.0.0.1 port 1 from 192.0.2.8 port 3");
+  // Forgeries: the right text from a user's process, or under sshd's identifier only.
+  SendAs("sshd", 65534, "Failed password for root from 198.51.100.1 port 4 ssh2");
+  SendAs("logger", 0, "Failed password for root from 198.51.100.2 port 5 ssh2");
+  SendAs("sshd", 0, "Connection closed by invalid user last 192.0.2.9 port 6 [preauth]");
+  ASSERT_TRUE(daemon->waitForLine(out, "|last|"));
+  EXPECT_EQ(daemon->stop(), 0);
+  EXPECT_EQ(ReadFile(out),
+            "auth.success|192.0.2.7|alice|Journal\n"
+            "auth.failure|2001:db8::1|bob|Journal\n"
+            "auth.failure|192.0.2.8|x from 10.0.0.1 port 1|Journal\n"
+            "auth.failure|192.0.2.9|last|Journal\n");
+
+  // Stopped, the daemon misses nothing: a restart resumes after the saved cursor.
+  SendAs("sshd", 0, "Failed password for during from 192.0.2.10 port 7 ssh2");
+  start();
+  SendAs("sshd", 0, "Failed password for after from 192.0.2.11 port 8 ssh2");
+  ASSERT_TRUE(daemon->waitForLine(out, "|after|"));
+  EXPECT_EQ(daemon->stop(), 0);
+  EXPECT_THAT(ReadFile(out), ::testing::EndsWith("auth.failure|192.0.2.9|last|Journal\n"
+                                                 "auth.failure|192.0.2.10|during|Journal\n"
+                                                 "auth.failure|192.0.2.11|after|Journal\n"));
 }
 
 }  // namespace

@@ -64,6 +64,7 @@ class SourcesTest : public ::testing::Test {
         {"structuredLogPath", Str(dir.file("records.jsonl"))},
         {"stateDirectory", Str(dir.file("state"))},
         {"eventSocketPath", Str(mSocketPath)},
+        {"authLogSource", Str("auditpipe")},
     };
     config.insert(config.end(), extraConfig.begin(), extraConfig.end());
     mConfigPath = dir.write("tarvod.plist", ConfigPlist(config));

@@ -105,6 +105,12 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   mMonitor = std::make_unique<Monitor>(EngineHooks(*mEngine));
   mMonitor->setEventSocketPath(
       ConfigurationString(mConfiguration, "eventSocketPath", kDefaultEventSocketPath));
+  const std::string authLogSource = ConfigurationString(mConfiguration, "authLogSource", "journal");
+  const std::string stateDirectory =
+      ConfigurationString(mConfiguration, "stateDirectory", kDefaultStateDirectory);
+  // The journal cursor lives beside the saved state, so that a restart resumes where it was.
+  if (authLogSource == "journal") mFiles.makeDirectories(stateDirectory, 0700);
+  mMonitor->setAuthLogSource(authLogSource, stateDirectory + "/journal_cursor");
   mMonitor->setEventFilterUID(FilterList(mConfiguration, "filterByUID"),
                               FilterList(mConfiguration, "filterByGID"));
   mEngine->postStartupEvent(false);

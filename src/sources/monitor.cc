@@ -8,6 +8,7 @@
 #include "platform/event_loop.h"
 #include "sources/audit_pipe.h"
 #include "sources/event_listener.h"
+#include "sources/ssh_journal.h"
 
 namespace tarvod {
 namespace {
@@ -39,6 +40,7 @@ Monitor::~Monitor() {
     mXPCEventConnection.reset();
     mBSMReadSource.reset();
     mPeers.reset();
+    mSshJournal.reset();
     mProgressSource.reset();
   });
   mInputEvtQ.reset();
@@ -87,6 +89,21 @@ void Monitor::beginListening() {
     LogMessage(1, "XPC event listener failed to start up");
   }
 
+  if (mAuthLogSource == "journal") {
+    LogMessage(1, "Following sshd in the systemd journal");
+    mInputEvtQ->sync([&] {
+      Result<std::unique_ptr<SshJournalSource>> source =
+          SshJournalSource::Start(*this, *mInputEvtQ, mJournalCursorPath);
+      if (source.ok()) {
+        mSshJournal = std::move(source.value());
+      } else {
+        LogMessage(0, "Failed to follow the systemd journal for SSH logins: %s errno = %d",
+                   source.status().what().c_str(), source.status().error());
+      }
+    });
+    return;
+  }
+  if (mAuthLogSource != "auditpipe") return;
   LogMessage(1, "Opening the BSM Auditpipe");
   int descriptor = -1;
   uint64_t bufferSize = 0;
@@ -112,6 +129,7 @@ void Monitor::stopListening() {
     mXPCEventConnection.reset();
     mPeers.reset();
     mBSMReadSource.reset();  // closes the pipe
+    mSshJournal.reset();     // saves the journal cursor
   });
   // Every event already read on the input queue has been dispatched once this returns.
   mInputEvtQ->sync([] {});

@@ -24,6 +24,7 @@ class EventLoop;
 class EventListener;
 class IoSource;
 class PeerConnections;
+class SshJournalSource;
 class AuditReadSource;
 
 using IdSet = std::set<int64_t>;
@@ -59,6 +60,14 @@ class Monitor {
   ~Monitor();
   Monitor(const Monitor&) = delete;
   Monitor& operator=(const Monitor&) = delete;
+
+  // Where SSH logins come from (configuration key authLogSource): "journal" (sshd's lines in
+  // the systemd journal, resumed from the cursor saved at journalCursorPath), "auditpipe"
+  // (the BSM audit pipe) or "none". Set before beginListening; the default is "auditpipe".
+  void setAuthLogSource(std::string kind, std::string journalCursorPath) {
+    mAuthLogSource = std::move(kind);
+    mJournalCursorPath = std::move(journalCursorPath);
+  }
 
   // The event socket's path (configuration key eventSocketPath); set before beginListening.
   void setEventSocketPath(std::string path) { mEventSocketPath = std::move(path); }
@@ -96,6 +105,9 @@ class Monitor {
   uint64_t mEventBufferSize = 0;
   std::unique_ptr<AuditReadSource> mBSMReadSource;
   std::unique_ptr<IoSource> mProgressSource;
+  std::unique_ptr<SshJournalSource> mSshJournal;
+  std::string mAuthLogSource = "auditpipe";
+  std::string mJournalCursorPath;
   std::optional<IdSet> mAllowedUIDs;
   std::optional<IdSet> mAllowedGIDs;
 
