@@ -158,6 +158,11 @@ int DaemonMain(int argc, char** argv) {
   BuildLevelNameTable();
   InitHostStats();
   ConfigureStructuredLog(ConfigurationString(configuration, "structuredLogPath", ""));
+  if (!DefaultStructuredLog().canDeliver()) {
+    LogMessage(0,
+               "Event records have nowhere to go: no journal socket (journald is not running) and "
+               "no structuredLogPath; start systemd-journald or set structuredLogPath to a file");
+  }
 
   // Steps 15 to 18: the rules.
   auto rulebase = std::make_shared<Rulebase>();
