@@ -6,6 +6,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -13,6 +14,8 @@
 #include <fstream>
 #include <sstream>
 #include <thread>
+
+#include "platform/seqpacket.h"
 
 namespace tarvod::testing {
 
@@ -252,6 +255,50 @@ long StatusField(pid_t pid, std::string_view field) {
   return -1;
 }
 }  // namespace
+
+size_t CountLines(const std::string& path) {
+  const std::string text = ReadFile(path);
+  return static_cast<size_t>(std::count(text.begin(), text.end(), '\n'));
+}
+
+bool WaitForLines(const std::string& path, size_t count, std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (CountLines(path) < count) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(50ms);
+  }
+  return true;
+}
+
+std::string SendEvents(const std::string& socketPath, int count,
+                       const std::function<std::string(int)>& eventXml) {
+  SocketResult connection;
+  for (int attempt = 0; attempt < 150; ++attempt) {
+    connection = ConnectSeqpacket(socketPath);
+    if (connection.fd >= 0) break;
+    std::this_thread::sleep_for(100ms);
+  }
+  if (connection.fd < 0) return connection.error;
+  std::string error;
+  for (int i = 0; i < count && error.empty(); ++i) SendPacket(connection.fd, eventXml(i), &error);
+  close(connection.fd);
+  return error;
+}
+
+LineCount CountLogLine(const std::string& log, std::string_view line) {
+  const std::string summary = std::string(line) + " repeated ";
+  LineCount count;
+  std::istringstream in(log);
+  std::string text;
+  while (std::getline(in, text)) {
+    if (text == line) {
+      ++count.written;
+    } else if (text.rfind(summary, 0) == 0) {
+      count.repeated += std::strtoull(text.c_str() + summary.size(), nullptr, 10);
+    }
+  }
+  return count;
+}
 
 long ResidentKb(pid_t pid) { return StatusField(pid, "VmRSS:"); }
 long PeakResidentKb(pid_t pid) { return StatusField(pid, "VmHWM:"); }

@@ -6,6 +6,8 @@
 
 #include <chrono>
 #include <csignal>
+#include <cstdint>
+#include <functional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -81,6 +83,25 @@ class Daemon {
   int mStatus = -1;
   std::string mStderrPath;
 };
+
+// Number of newline-terminated lines in a file; 0 when it cannot be read.
+size_t CountLines(const std::string& path);
+// Waits until the file holds at least count lines; false on timeout.
+bool WaitForLines(const std::string& path, size_t count, std::chrono::milliseconds timeout);
+
+// Sends count events over the event socket at socketPath on one connection, retrying the
+// connection while the daemon's listener comes up; eventXml(i) is the i-th event's property
+// list. Returns the empty string, or what failed.
+std::string SendEvents(const std::string& socketPath, int count,
+                       const std::function<std::string(int)>& eventXml);
+
+// How often the error log reports one line: the times it was written and the sum N of its
+// "LINE repeated N times in the last ..." summaries.
+struct LineCount {
+  size_t written = 0;
+  uint64_t repeated = 0;
+};
+LineCount CountLogLine(const std::string& log, std::string_view line);
 
 // Resident set size of a process in kB (VmRSS), and its peak (VmHWM); -1 when unknown.
 long ResidentKb(pid_t pid);

@@ -1,6 +1,7 @@
 // Load without loss: many concurrent senders against one counting rule. Every event must be
 // counted, and the daemon's memory must stay bounded while the rule engine lags behind the
-// senders (the event socket then stops reading and senders wait in the kernel).
+// senders (the event socket then stops reading and senders wait in the kernel). And a flood
+// of one failure must leave a few counted lines in the error log, not one line per event.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <signal.h>
@@ -10,10 +11,12 @@
 #include <atomic>
 #include <chrono>
 #include <filesystem>
+#include <optional>
 #include <thread>
+#include <utility>
+#include <vector>
 
 #include "harness.h"
-#include "platform/seqpacket.h"
 #include "rules_xml.h"
 
 namespace tarvod::testing {
@@ -35,12 +38,6 @@ constexpr bool kMeasuresOwnMemory = true;
 
 std::string EventPlist(const char* type, const std::string& n) {
   return PlistDocument(Dict({{"eventType", Str(type)}, {"eventDetails", Dict({{"n", Str(n)}})}}));
-}
-
-size_t CountLines(const std::string& path) {
-  if (!FileExists(path)) return 0;
-  const std::string text = ReadFile(path);
-  return static_cast<size_t>(std::count(text.begin(), text.end(), '\n'));
 }
 
 TEST(Load, EveryEventOfEightConcurrentSendersIsCountedInBoundedMemory) {
@@ -72,23 +69,13 @@ TEST(Load, EveryEventOfEightConcurrentSendersIsCountedInBoundedMemory) {
   std::vector<std::thread> senders;
   for (int s = 0; s < kSenders; ++s) {
     senders.emplace_back([&, s] {
-      const SocketResult connection = ConnectSeqpacket(socketPath);
-      if (connection.fd < 0) {
-        ++failures;
-        return;
-      }
-      std::string error;
-      for (int i = 0; i < kEventsPerSender; ++i) {
-        const std::string message = PlistDocument(
+      const std::string error = SendEvents(socketPath, kEventsPerSender, [s](int i) {
+        return PlistDocument(
             "<dict><key>eventType</key><string>load</string><key>eventDetails</key>"
             "<dict><key>n</key><string>" +
             std::to_string(s) + "-" + std::to_string(i) + "</string></dict></dict>");
-        if (!SendPacket(connection.fd, message, &error)) {
-          ++failures;
-          break;
-        }
-      }
-      close(connection.fd);
+      });
+      if (!error.empty()) ++failures;
     });
   }
   for (auto& t : senders) t.join();
@@ -137,21 +124,13 @@ TEST(Load, ReloadsUnderLoadLoseNoEventAndSwapInTheNewRules) {
   Daemon daemon({"-c", config, "-r", dir.file("rules"), "-n", "-v", "1"}, dir);
   ASSERT_TRUE(daemon.waitForLine(dir.file("error.log"), "Registered"));
 
-  std::atomic<int> failures{0};
+  std::vector<std::string> failures(kSenders);
   std::vector<std::thread> senders;
   for (int s = 0; s < kSenders; ++s) {
     senders.emplace_back([&, s] {
-      const SocketResult connection = ConnectSeqpacket(socketPath);
-      std::string error;
-      for (int i = 0; i < kEventsEach && connection.fd >= 0; ++i) {
-        if (!SendPacket(connection.fd,
-                        EventPlist("load", std::to_string(s) + "-" + std::to_string(i)), &error)) {
-          ++failures;
-          break;
-        }
-      }
-      if (connection.fd < 0) ++failures;
-      close(connection.fd);
+      failures[s] = SendEvents(socketPath, kEventsEach, [s](int i) {
+        return EventPlist("load", std::to_string(s) + "-" + std::to_string(i));
+      });
     });
   }
   for (int g = 1; g <= kReloads; ++g) {
@@ -160,11 +139,8 @@ TEST(Load, ReloadsUnderLoadLoseNoEventAndSwapInTheNewRules) {
     ASSERT_TRUE(daemon.waitForLine(counted, "reload " + std::to_string(g) + "\n", 60s)) << g;
   }
   for (auto& t : senders) t.join();
-  ASSERT_EQ(failures, 0);
-  const SocketResult last = ConnectSeqpacket(socketPath);
-  std::string error;
-  ASSERT_TRUE(SendPacket(last.fd, EventPlist("load", "final"), &error));
-  close(last.fd);
+  for (const std::string& failure : failures) ASSERT_EQ(failure, "");
+  ASSERT_EQ(SendEvents(socketPath, 1, [](int) { return EventPlist("load", "final"); }), "");
   // Connections are read in no fixed order: wait for every line, not for the last sent.
   const size_t expected = static_cast<size_t>(kSenders * kEventsEach + kReloads + 1);
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::minutes(2);
@@ -186,6 +162,81 @@ TEST(Load, ReloadsUnderLoadLoseNoEventAndSwapInTheNewRules) {
     EXPECT_LT(PeakResidentKb(daemon.pid()), kResidentBoundKb);
   }
   EXPECT_EQ(daemon.stop(), 0);
+}
+
+// A rule whose first log action cannot open its file ("missing/" does not exist), so that each
+// event logs "LOG: Cannot open ..."; events alternate between two such files. The second
+// action counts the events that ran.
+struct FloodCase {
+  const char* name;
+  std::optional<int> repeatInterval;  // logRepeatInterval; nullopt: absent
+  int events;
+  // true: the counts must add up while the daemon still runs (the summary of the last window
+  // is written when the window ends, with no further line); false: once it has stopped.
+  bool countsBeforeStop;
+};
+
+TEST(Load, AFloodOfOneFailureLeavesAFewLinesWhoseCountsAddUp) {
+  const FloodCase cases[] = {
+      {"default interval", std::nullopt, 100'000, false},
+      {"2 s interval", 2, 20'000, true},
+      {"limit off", 0, 2'000, false},
+  };
+  for (const FloodCase& c : cases) {
+    SCOPED_TRACE(c.name);
+    TempDir dir;
+    const std::string errorLog = dir.file("error.log");
+    const std::string socketPath = dir.file("evtq");
+    const std::string counted = dir.file("counted.log");
+    std::vector<std::pair<std::string, std::string>> config = {
+        {"errorLogPath", Str(errorLog)},
+        {"structuredLogPath", Str(dir.file("records.jsonl"))},
+        {"stateDirectory", Str(dir.path())},
+        {"eventSocketPath", Str(socketPath)}};
+    if (c.repeatInterval) config.emplace_back("logRepeatInterval", Int(*c.repeatInterval));
+    const std::string configPath = dir.write("tarvod.plist", ConfigPlist(config));
+    const std::string rules = dir.write(
+        "rules.plist",
+        RulesDocument({RuleXml("flood", {"flood"},
+                               {{"actions", Arr({FileLog("x", dir.file("missing/${event:which}")),
+                                                 FileLog("${event:which}", counted)})}})}));
+    Daemon daemon({"-c", configPath, "-r", rules, "-n"}, dir);
+    ASSERT_EQ(SendEvents(socketPath, c.events,
+                         [](int i) {
+                           return PlistDocument(
+                               Dict({{"eventType", Str("flood")},
+                                     {"eventDetails", Dict({{"which", Str(i % 2 ? "b" : "a")}})}}));
+                         }),
+              "");
+    ASSERT_TRUE(WaitForLines(counted, c.events, std::chrono::minutes(3)));
+
+    const auto countsAddUp = [&] {
+      const std::string log = ReadFile(errorLog);
+      for (const char* which : {"a", "b"}) {
+        const std::string line = "LOG: Cannot open " + dir.file("missing/") + which + " errno = 2";
+        const LineCount count = CountLogLine(log, line);
+        if (count.written + count.repeated != static_cast<size_t>(c.events / 2)) return false;
+        if (c.repeatInterval == 0 && count.written != static_cast<size_t>(c.events / 2)) {
+          return false;
+        }
+      }
+      return true;
+    };
+    if (c.countsBeforeStop) {
+      const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(15);
+      while (!countsAddUp() && std::chrono::steady_clock::now() < deadline) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+      }
+      EXPECT_TRUE(countsAddUp()) << ReadFile(errorLog);
+    }
+    EXPECT_EQ(daemon.stop(), 0);
+    EXPECT_TRUE(countsAddUp()) << ReadFile(errorLog).substr(0, 4000);
+    // Records go to structuredLogPath, so nothing is said about a missing journal.
+    EXPECT_EQ(ReadFile(errorLog).find("nowhere to go"), std::string::npos);
+    if (c.repeatInterval != 0) {
+      EXPECT_LT(CountLines(errorLog), 100u);
+    }
+  }
 }
 
 }  // namespace

@@ -91,6 +91,11 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   BuildLevelNameTable();
   InitHostStats();
   ConfigureStructuredLog(ConfigurationString(mConfiguration, "structuredLogPath", ""));
+  if (!DefaultStructuredLog().canDeliver()) {
+    LogMessage(0,
+               "Event records have nowhere to go: no journal socket (journald is not running) and "
+               "no structuredLogPath; start systemd-journald or set structuredLogPath to a file");
+  }
 
   size_t ruleCount = 0;
   mEngine->swapRulebase(mEngine->loadRules(mRulesPath, &ruleCount));

@@ -9,6 +9,7 @@
 
 #include "daemon/configuration.h"
 #include "platform/diagnostic_log.h"
+#include "platform/repeat_limiter.h"
 
 namespace tarvod {
 namespace {
@@ -46,6 +47,10 @@ int OpenLog(const std::string& path) {
 int SetUpLogs(const plist::Dictionary& configuration) {
   ConsoleMessage("SetUpLogs: uid = %ld gid = %ld", static_cast<long>(getuid()),
                  static_cast<long>(getgid()));
+  SetLogRepeatInterval(
+      configuration.contains("logRepeatInterval")
+          ? static_cast<double>(ConfigurationInteger(configuration, "logRepeatInterval"))
+          : kDefaultLogRepeatInterval);
   if (const std::string* errorLogPath = configuration.findString("errorLogPath")) {
     if (errorLogPath->rfind(kVelkinLogDirectory, 0) == 0 && !EnsureVelkinDirectory()) return -1;
     const int fd = OpenLog(*errorLogPath);

@@ -6,21 +6,52 @@
 
 #include <atomic>
 #include <cerrno>
+#include <chrono>
+#include <condition_variable>
 #include <cstdarg>
 #include <cstdio>
+#include <functional>
 #include <mutex>
+#include <optional>
 #include <string>
+#include <string_view>
+#include <thread>
+#include <vector>
+
+#include "platform/clock.h"
+#include "platform/repeat_limiter.h"
 
 namespace tarvod {
 namespace {
 
 std::atomic<int64_t> gDebugLevel{0};
 
-// The error log descriptor and the buffer messages are formatted into are both guarded by
-// gErrorLogLock; the descriptor is -1 while no error log is attached.
-std::mutex gErrorLogLock;
-int gErrorLogFd = -1;
-char gFormatBuffer[kMaxLogMessageBytes + 1];
+// Level-0 lines are written at every debug level, so a failure that recurs on every event
+// floods the log with them; they go through the repeat limiter. The higher levels are traces
+// the operator asks for, whose every line is needed to follow a rule, and are never limited.
+constexpr int64_t kHighestLimitedLevel = 0;
+
+// The error log. Every field is guarded by mLock: the descriptor (-1 while no error log is
+// attached), the buffer messages are formatted into, the repeat limiter and the state of the
+// summary writer.
+struct ErrorLog {
+  ~ErrorLog();
+
+  std::mutex mLock;
+  int mFd = -1;
+  char mBuffer[kMaxLogMessageBytes + 1];
+  const Clock& mClock = Clock::System();
+  RepeatLimiter mRepeats{mClock, kDefaultLogRepeatInterval};
+  std::vector<std::string> mSummaries;  // the limiter's summary lines, waiting to be written
+  // Writes a window's summary when the window ends and no further line comes to do it.
+  // Started at the first repeat that is counted; stopped by CloseLogs.
+  std::thread mSummaryWriter;
+  std::condition_variable mWindowsChanged;
+  bool mWriterIdle = false;  // the writer waits for a window to open
+  bool mStopWriter = false;
+};
+
+ErrorLog gErrorLog;
 
 std::atomic<int> gEventLogFd{-1};
 
@@ -38,6 +69,54 @@ void WriteFully(int fd, const char* data, size_t length) {
   }
 }
 
+// Writes the summary lines the limiter handed out; drops them while no error log is attached.
+// Called with mLock held.
+void WriteSummaries(ErrorLog& log) {
+  if (log.mFd >= 0) {
+    for (const std::string& line : log.mSummaries) {
+      WriteFully(log.mFd, line.data(), line.size());
+      WriteFully(log.mFd, "\n", 1);
+    }
+  }
+  log.mSummaries.clear();
+}
+
+void RunSummaryWriter(ErrorLog& log) {
+  std::unique_lock<std::mutex> lock(log.mLock);
+  while (!log.mStopWriter) {
+    const std::optional<double> end = log.mRepeats.nextEnd();
+    if (!end) {
+      log.mWriterIdle = true;
+      log.mWindowsChanged.wait(lock);
+      log.mWriterIdle = false;
+      continue;
+    }
+    const double wait = *end - log.mClock.monotonic();
+    if (wait > 0) {
+      log.mWindowsChanged.wait_for(lock, std::chrono::duration<double>(wait));
+      continue;
+    }
+    log.mRepeats.collectEnded(log.mSummaries);
+    WriteSummaries(log);
+  }
+}
+
+// Stops the summary writer and waits for it. Called without mLock.
+void StopSummaryWriter(ErrorLog& log) {
+  std::thread writer;
+  {
+    std::lock_guard<std::mutex> lock(log.mLock);
+    log.mStopWriter = true;
+    writer = std::move(log.mSummaryWriter);
+  }
+  log.mWindowsChanged.notify_all();
+  if (writer.joinable()) writer.join();
+  std::lock_guard<std::mutex> lock(log.mLock);
+  log.mStopWriter = false;
+}
+
+ErrorLog::~ErrorLog() { StopSummaryWriter(*this); }
+
 }  // namespace
 
 void SetDebugLevel(int64_t level) { gDebugLevel.store(level, std::memory_order_relaxed); }
@@ -45,16 +124,38 @@ int64_t DebugLevel() { return gDebugLevel.load(std::memory_order_relaxed); }
 
 void LogMessage(int64_t level, const char* format, ...) {
   if (level > gDebugLevel.load(std::memory_order_relaxed)) return;
-  std::lock_guard<std::mutex> lock(gErrorLogLock);
-  if (gErrorLogFd < 0) return;
+  ErrorLog& log = gErrorLog;
+  std::lock_guard<std::mutex> lock(log.mLock);
+  if (log.mFd < 0) return;
   va_list args;
   va_start(args, format);
-  const int n = std::vsnprintf(gFormatBuffer, sizeof gFormatBuffer, format, args);
+  const int n = std::vsnprintf(log.mBuffer, sizeof log.mBuffer, format, args);
   va_end(args);
   size_t length = 0;
   if (n > 0) length = std::min(static_cast<size_t>(n), kMaxLogMessageBytes);
-  WriteFully(gErrorLogFd, gFormatBuffer, length);
-  WriteFully(gErrorLogFd, "\n", 1);
+  bool write = true;
+  if (level <= kHighestLimitedLevel) {
+    write = log.mRepeats.admit(std::string_view(log.mBuffer, length), log.mSummaries);
+    if (!write && !log.mSummaryWriter.joinable()) {
+      log.mSummaryWriter = std::thread(RunSummaryWriter, std::ref(log));
+    } else if (write && log.mWriterIdle) {
+      log.mWindowsChanged.notify_one();  // a window opened: the writer waits for its end
+    }
+  } else {
+    log.mRepeats.collectEnded(log.mSummaries);
+  }
+  WriteSummaries(log);
+  if (!write) return;
+  WriteFully(log.mFd, log.mBuffer, length);
+  WriteFully(log.mFd, "\n", 1);
+}
+
+void SetLogRepeatInterval(double seconds) {
+  ErrorLog& log = gErrorLog;
+  std::lock_guard<std::mutex> lock(log.mLock);
+  log.mRepeats.collectAll(log.mSummaries);
+  WriteSummaries(log);
+  log.mRepeats.setInterval(seconds);
 }
 
 void ConsoleMessage(const char* format, ...) {
@@ -88,9 +189,10 @@ int SafeOpen(const char* path, mode_t mode, int flags) {
 
 void AttachErrorLog(int fd) {
   lseek(fd, 0, SEEK_END);
-  std::lock_guard<std::mutex> lock(gErrorLogLock);
-  if (gErrorLogFd >= 0) close(gErrorLogFd);
-  gErrorLogFd = fd;
+  ErrorLog& log = gErrorLog;
+  std::lock_guard<std::mutex> lock(log.mLock);
+  if (log.mFd >= 0) close(log.mFd);
+  log.mFd = fd;
 }
 
 void AttachEventLog(int fd) {
@@ -114,12 +216,19 @@ void CloseLogs() {
     fsync(eventFd);
     close(eventFd);
   }
-  std::lock_guard<std::mutex> lock(gErrorLogLock);
-  if (gErrorLogFd >= 0) {
-    fsync(gErrorLogFd);
-    close(gErrorLogFd);
-    gErrorLogFd = -1;
+  ErrorLog& log = gErrorLog;
+  {
+    std::lock_guard<std::mutex> lock(log.mLock);
+    // The counts of the windows still open are written before the log closes.
+    log.mRepeats.collectAll(log.mSummaries);
+    WriteSummaries(log);
+    if (log.mFd >= 0) {
+      fsync(log.mFd);
+      close(log.mFd);
+      log.mFd = -1;
+    }
   }
+  StopSummaryWriter(log);
 }
 
 }  // namespace tarvod

@@ -16,7 +16,17 @@ inline constexpr size_t kMaxLogMessageBytes = 2047;
 
 // Writes one line to the error log when level <= the debug level: the formatted text, cut to
 // kMaxLogMessageBytes, then one newline. Writes nothing while no error log is attached.
+// Level-0 lines are rate-limited by their text: a text written less than the repeat interval
+// ago is counted instead of written, and when that interval ends one line "TEXT repeated N
+// times in the last I s" follows, written by the next line or, when none comes, by a thread
+// the error log starts at the first counted repeat and stops in CloseLogs (which writes the
+// counts still open). Different texts are never counted together; lines of the higher
+// levels are always written.
 void LogMessage(int64_t level, const char* format, ...) __attribute__((format(printf, 2, 3)));
+
+// The repeat interval in seconds (10 until set); 0 or less writes every line. The counts
+// still open are written first.
+void SetLogRepeatInterval(double seconds);
 
 void SetDebugLevel(int64_t level);
 int64_t DebugLevel();

@@ -12,6 +12,7 @@
 #include <thread>
 #include <vector>
 
+#include "platform/repeat_limiter.h"
 #include "platform/testing/log_capture.h"
 
 namespace tarvod {
@@ -30,6 +31,7 @@ class DiagnosticLogTest : public ::testing::Test {
   void TearDown() override {
     CloseLogs();
     SetDebugLevel(0);
+    SetLogRepeatInterval(kDefaultLogRepeatInterval);
     std::error_code ignored;
     std::filesystem::remove_all(dir_, ignored);
   }
@@ -54,7 +56,9 @@ TEST_F(DiagnosticLogTest, LinesFromConcurrentWritersNeverInterleave) {
   std::vector<std::thread> writers;
   for (int t = 0; t < 4; ++t) {
     writers.emplace_back([t] {
-      for (int i = 0; i < 200; ++i) LogMessage(0, "%d:%s", t, std::string(100, 'a' + t).c_str());
+      for (int i = 0; i < 200; ++i) {
+        LogMessage(0, "%d:%03d:%s", t, i, std::string(100, 'a' + t).c_str());
+      }
     });
   }
   for (auto& w : writers) w.join();
@@ -63,10 +67,34 @@ TEST_F(DiagnosticLogTest, LinesFromConcurrentWritersNeverInterleave) {
   int count = 0;
   while (std::getline(lines, line)) {
     ++count;
-    ASSERT_EQ(line.size(), 102u);
-    EXPECT_EQ(line.substr(2), std::string(100, static_cast<char>('a' + (line[0] - '0'))));
+    ASSERT_EQ(line.size(), 106u);
+    EXPECT_EQ(line.substr(6), std::string(100, static_cast<char>('a' + (line[0] - '0'))));
   }
   EXPECT_EQ(count, 800);
+}
+
+TEST_F(DiagnosticLogTest, CountsRepeatedLevelZeroLinesAndWritesTheCountsAtClose) {
+  SetDebugLevel(1);
+  for (int i = 0; i < 5; ++i) {
+    LogMessage(0, "LOG: Cannot open %s errno = %d", "/a", 2);
+    LogMessage(1, "trace");
+    LogMessage(2, "above the debug level");
+  }
+  LogMessage(0, "LOG: Cannot open %s errno = %d", "/b", 2);
+  CloseLogs();
+  EXPECT_EQ(testing::ReadWholeFile(path_),
+            "LOG: Cannot open /a errno = 2\ntrace\ntrace\ntrace\ntrace\ntrace\n"
+            "LOG: Cannot open /b errno = 2\n"
+            "LOG: Cannot open /a errno = 2 repeated 4 times in the last 10 s\n");
+}
+
+TEST_F(DiagnosticLogTest, AZeroRepeatIntervalWritesTheOpenCountsThenEveryLine) {
+  for (int i = 0; i < 3; ++i) LogMessage(0, "again");
+  SetLogRepeatInterval(0);
+  for (int i = 0; i < 3; ++i) LogMessage(0, "again");
+  CloseLogs();
+  EXPECT_EQ(testing::ReadWholeFile(path_),
+            "again\nagain repeated 2 times in the last 10 s\nagain\nagain\nagain\n");
 }
 
 TEST_F(DiagnosticLogTest, NothingIsWrittenAfterTheLogsAreClosed) {

@@ -39,8 +39,15 @@ constexpr const char* kJournalSocket = "/run/systemd/journal/socket";
 // The journal takes field names of at most 64 characters.
 constexpr size_t kMaxFieldName = 64;
 
+bool JournalSocketPresent() {
+  struct stat st {};
+  return stat(kJournalSocket, &st) == 0 && S_ISSOCK(st.st_mode);
+}
+
 class JournalLog final : public StructuredLog {
  public:
+  bool canDeliver() override { return JournalSocketPresent(); }
+
   bool send(int priority, std::string_view message, const LogAttributes& attributes) override {
     std::vector<std::string> fields;
     fields.reserve(attributes.size() + 3);
@@ -57,8 +64,7 @@ class JournalLog final : public StructuredLog {
     }
     // sd_journal_sendv reports success when the journal's socket does not exist (it drops the
     // record silently); a record that cannot reach the journal must count as failed.
-    struct stat st {};
-    if (stat(kJournalSocket, &st) != 0 || !S_ISSOCK(st.st_mode)) return false;
+    if (!JournalSocketPresent()) return false;
     // sd_journal_sendv is safe to call from several threads at once.
     return sd_journal_sendv(vectors.data(), static_cast<int>(vectors.size())) >= 0;
   }

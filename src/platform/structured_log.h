@@ -17,6 +17,9 @@ class StructuredLog {
   virtual ~StructuredLog() = default;
   // Sends one record; false when it could not be delivered.
   virtual bool send(int priority, std::string_view message, const LogAttributes& attributes) = 0;
+  // False when every record is bound to fail: the journal is the sink and its socket is
+  // missing (a host without journald). A file sink is taken to be able to deliver.
+  virtual bool canDeliver() { return true; }
 };
 
 // Selects the sink: the journal when path is empty, else the JSON-lines file at path (one

@@ -1,5 +1,6 @@
 // Unit-test helper: points the error log at a fresh temporary file for the life of the object,
-// so a test can read back exactly what was logged. Test thread only.
+// so a test can read back exactly what was logged: every line, with the repeat limit off (it
+// has tests of its own). Test thread only.
 #pragma once
 
 #include <fcntl.h>
@@ -13,6 +14,7 @@
 #include <string_view>
 
 #include "platform/diagnostic_log.h"
+#include "platform/repeat_limiter.h"
 
 namespace tarvod::testing {
 
@@ -33,10 +35,12 @@ class LogCapture {
     const int fd = SafeOpen(mPath.c_str(), 0600, O_WRONLY | O_APPEND);
     if (fd >= 0) AttachErrorLog(fd);
     SetDebugLevel(level);
+    SetLogRepeatInterval(0);
   }
   ~LogCapture() {
     CloseLogs();
     SetDebugLevel(0);
+    SetLogRepeatInterval(kDefaultLogRepeatInterval);
     std::error_code ignored;
     std::filesystem::remove_all(mDirectory, ignored);
   }
