@@ -100,5 +100,49 @@ TEST(Dispatch, EmptyComponentsOfATypeArePrefixesToo) {
   ConfigureStructuredLog("");
 }
 
+TEST(Dispatch, TypesBeyondTheLimitsAreDroppedWithOneMessage) {
+  testing::LogCapture capture(1);
+  const std::string records = capture.directory() + "/records.jsonl";
+  ConfigureStructuredLog(records);
+  auto variables = std::make_shared<VariableStore>();
+  variables->set(kGlobalsKey, Dictionary{{"count", Value::Integer(0)}});
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)["a"].rules = {CountingRule("a")};
+  auto repeated = [](const std::string& piece, size_t times) {
+    std::string text;
+    for (size_t i = 0; i < times; ++i) text += piece;
+    return text;
+  };
+  const struct {
+    std::string type;
+    bool runs;
+  } cases[] = {
+      {"a" + repeated(".b", 63), true},           // 64 components
+      {"a" + repeated(".b", 64), false},          // 65
+      {"a." + std::string(1022, 'b'), true},      // 1,024 bytes
+      {"a." + std::string(1023, 'b'), false},     // 1,025
+      {"a" + repeated(".a", 60'000 - 1), false},  // 120 KB of "a."
+  };
+  int64_t expected = 0;
+  for (const auto& c : cases) {
+    DispatchEvent(rulebase, Dictionary{{"eventType", c.type}}, variables);
+    expected += c.runs ? 1 : 0;
+  }
+  ProcessingQueue().drain();
+  EXPECT_EQ(variables->findDictionary(kGlobalsKey)->find("count")->integerValue(), expected);
+  // Two records for each event that ran (its full type and "a"), none for a dropped one.
+  EXPECT_EQ(testing::ReadJsonRecords(records).size(), 2u * static_cast<size_t>(expected));
+  const std::string log = capture.text();
+  size_t dropped = 0;
+  for (size_t at = log.find("DispatchEvent: dropping"); at != std::string::npos;
+       at = log.find("DispatchEvent: dropping", at + 1)) {
+    ++dropped;
+  }
+  EXPECT_EQ(dropped, 3u) << log;
+  EXPECT_NE(log.find("has 119999 bytes and 60000 components (at most 1024 and 64)"),
+            std::string::npos);
+  ConfigureStructuredLog("");
+}
+
 }  // namespace
 }  // namespace tarvod
