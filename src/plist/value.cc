@@ -328,11 +328,15 @@ std::vector<std::string> Dictionary::sortedKeys() const {
   return keys;
 }
 
+bool IsFormattableDate(Date date) {
+  const double seconds = std::floor(date.secondsSince2001 + kUnixTimeOfReferenceDate);
+  // 0001-01-01 00:00:00 to 9999-12-31 23:59:59 UTC, in Unix seconds; NaN fails both.
+  return seconds >= -62135596800.0 && seconds <= 253402300799.0;
+}
+
 std::string FormatDate(Date date, bool localTime) {
   double seconds = std::floor(date.secondsSince2001 + kUnixTimeOfReferenceDate);
-  if (!std::isfinite(seconds) || seconds > 253402300799.0 || seconds < -62135596800.0) {
-    seconds = kUnixTimeOfReferenceDate;  // outside years 1 to 9999: show the reference date
-  }
+  if (!IsFormattableDate(date)) seconds = kUnixTimeOfReferenceDate;
   const time_t t = static_cast<time_t>(seconds);
   struct tm tm {};
   if (localTime) {

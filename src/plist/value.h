@@ -175,7 +175,10 @@ std::string Describe(const Dictionary& dictionary);
 // text reader and JSON read back.
 void AppendEscapedString(std::string& out, std::string_view text);
 
-// Formats a date as "YYYY-MM-DD HH:MM:SS +HHMM" in the given zone (local time when true).
+// Whether FormatDate can show the date: a finite time in the years 1 to 9999 (UTC).
+bool IsFormattableDate(Date date);
+// Formats a date as "YYYY-MM-DD HH:MM:SS +HHMM" in the given zone (local time when true); a
+// date that is not formattable shows as the reference date.
 std::string FormatDate(Date date, bool localTime);
 // Reads a date back from FormatDate's form ("YYYY-MM-DD HH:MM:SS +HHMM", any zone offset) or
 // from the XML property-list form ("YYYY-MM-DDTHH:MM:SSZ"); years 1 to 9999. nullopt when the
