@@ -483,6 +483,8 @@ bool IsPlainWord(const std::string& s) {
   if (s == "true" || s == "false" || s == "nan" || s == "inf") return false;
   // "//" and "/*" would start a comment where a value is expected.
   if (s.starts_with("//")) return false;
+  // The binary property list's magic would make the whole text read back as a binary list.
+  if (s.starts_with("bplist")) return false;
   return std::all_of(s.begin(), s.end(), IsWordChar);
 }
 
