@@ -112,7 +112,7 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
 
 void LogToFile(const std::string& path, const std::string& message) {
   // Neither truncated nor appending: the seek to the end is what places the line.
-  const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+  const int fd = OpenLogDestination(path.c_str(), O_CREAT, 0644);
   if (fd < 0) {
     LogMessage(0, "LOG: Cannot open %s errno = %d", path.c_str(), errno);
     return;

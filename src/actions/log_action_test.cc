@@ -79,6 +79,12 @@ TEST_F(LogActionTest, ReportsAFileThatCannotBeOpened) {
   Run(Dictionary{{"message", "m"}, {"logPath", dir_ + "/missing/out.log"}});
   EXPECT_NE(capture_.text().find("LOG: Cannot open " + dir_ + "/missing/out.log errno = 2\n"),
             std::string::npos);
+  // A FIFO is no log file: opened read-write, the daemon would be its own reader.
+  const std::string fifo = dir_ + "/fifo";
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  Run(Dictionary{{"message", "m"}, {"logPath", fifo}});
+  EXPECT_NE(capture_.text().find("LOG: Cannot open " + fifo + " errno = 6\n"), std::string::npos)
+      << capture_.text();
 }
 
 TEST_F(LogActionTest, SelectsTheStructuredLogByLogTypeInAnyCase) {
