@@ -97,8 +97,15 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
         return;
       }
       if (resolved && resolved->isDictionary()) {
+        // The details' keys are unique, so only the facility can share a name with one: the
+        // later value replaces it in place, as in event records.
+        const bool hasFacility = !attributes.empty();
         for (const auto& [key, value] : resolved->dictionary()) {
-          attributes.emplace_back(key, value.textForm());
+          if (hasFacility && key == attributes.front().first) {
+            attributes.front().second = value.textForm();
+          } else {
+            attributes.emplace_back(key, value.textForm());
+          }
         }
       }
     }

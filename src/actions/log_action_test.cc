@@ -138,6 +138,16 @@ TEST_F(LogActionTest, SendsKvlogDetailsAndALiteralFacilityWithTheMessageIntact) 
   const std::vector<std::pair<std::string, std::string>> expected = {
       {"Facility", "${global:who}"}, {"user", "root"}, {"n", "2"}};
   EXPECT_EQ(records[0].attributes, expected);
+
+  // A detail named like the facility attribute replaces it: one attribute per name.
+  Run(Dictionary{{"message", "m"},
+                 {"logType", "kvlog"},
+                 {"facility", "f"},
+                 {"details", Dictionary{{"a", "1"}, {"Facility", "${global:who}"}}}});
+  ASSERT_EQ(Records().size(), 2u);
+  const std::vector<std::pair<std::string, std::string>> replaced = {{"Facility", "root"},
+                                                                     {"a", "1"}};
+  EXPECT_EQ(Records()[1].attributes, replaced);
 }
 
 TEST_F(LogActionTest, RefusesKvlogDetailsThatAreNoDictionaryButSyslogIgnoresThem) {
