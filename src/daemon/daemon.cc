@@ -174,6 +174,10 @@ int DaemonMain(int argc, char** argv) {
   auto monitor = std::make_unique<Monitor>(rulebase, variables);
   monitor->setEventSocketPath(
       ConfigurationString(configuration, "eventSocketPath", kDefaultEventSocketPath));
+  monitor->setConnectionIdleTimeout(
+      ConfigurationInteger(configuration, "connectionIdleTimeout", kDefaultConnectionIdleTimeout));
+  monitor->setMaxConnectionsPerUID(
+      ConfigurationInteger(configuration, "maxConnectionsPerUID", kDefaultMaxConnectionsPerUID));
   // Step 20: sender filter.
   const auto filterText = [&](const char* key) -> std::optional<std::string> {
     const plist::Value* value = configuration.find(key);
