@@ -139,14 +139,22 @@ TEST_F(DaemonTest, RulesTreeLoadsEveryRulesFileAtAnyDepth) {
             RulesDocument({RuleXml("disabled", types, "<key>enabled</key><false/>"),
                            RuleXml("stringTypes", "<string>a.b</string>"), "<string>junk</string>",
                            RuleXml("twice", "<array><string>d</string><string>d</string></array>"),
-                           RuleXml("none", "<array/>")}));
+                           RuleXml("none", "<array/>"),
+                           RuleXml("oddTypes",
+                                   "<array><integer>5</integer><true/><array><string>e</string>"
+                                   "</array><string>e</string></array>")}));
   const std::string config = writeConfig({{"debugLevel", "<integer>3</integer>"}});
   Daemon daemon({"-c", config, "-r", dir.file("tree")}, dir);
   ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
   EXPECT_EQ(daemon.stop(SIGINT), 0);
   const std::string log = ReadFile(errorLog());
-  // one, two, three, four, twice and none; the disabled rule and the string-typed one are not.
-  EXPECT_THAT(log, HasSubstr("Loaded 6 rules\n"));
+  // one, two, three, four, twice, none and oddTypes; the disabled rule and the string-typed
+  // one are not.
+  EXPECT_THAT(log, HasSubstr("Loaded 7 rules\n"));
+  // Only the string among oddTypes' types indexes it; each other entry is named and skipped.
+  EXPECT_THAT(log, HasSubstr("  Skipping event type 5 of rule oddTypes: not a string\n"));
+  EXPECT_EQ(log.find("  Added rule: oddTypes\n"), log.rfind("  Added rule: oddTypes\n"));
+  EXPECT_NE(log.find("  Added rule: oddTypes\n"), std::string::npos);
   EXPECT_THAT(log, HasSubstr("  Skipping disabled rule: disabled\n"));
   EXPECT_THAT(log, Not(HasSubstr("stringTypes")));
   EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("tree/notes.txt"))));

@@ -3,6 +3,7 @@
 #include <gmock/gmock.h>
 #include <grp.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -159,6 +160,37 @@ TEST_F(SourcesTest, TheSenderFilterDecidesWhichSendersReachARule) {
     }
     mDaemon.reset();
   }
+}
+
+TEST_F(SourcesTest, IdleConnectionsOfOneUserCannotShutOutOtherSenders) {
+  startDaemon();
+  // An unprivileged user opens far more connections than the daemon serves and sends nothing.
+  int ready[2];
+  ASSERT_EQ(pipe(ready), 0);
+  const pid_t holder = fork();
+  if (holder == 0) {
+    close(ready[0]);
+    if (setgroups(0, nullptr) != 0 || setgid(65534) != 0 || setuid(65534) != 0) _exit(3);
+    for (int i = 0; i < 300; ++i) {
+      if (ConnectSeqpacket(mSocketPath).fd < 0) _exit(4);
+    }
+    if (write(ready[1], "r", 1) != 1) _exit(5);
+    pause();
+    _exit(0);
+  }
+  close(ready[1]);
+  pollfd waiting{ready[0], POLLIN, 0};
+  const bool opened = poll(&waiting, 1, 30'000) == 1;
+  char byte = 0;
+  const bool held = opened && read(ready[0], &byte, 1) == 1;
+  close(ready[0]);
+  ASSERT_TRUE(SendAs(0, 0, mSocketPath, EventMessage("t", "root")));
+  EXPECT_TRUE(waitForEvent("root 0 0\n")) << log();
+  kill(holder, SIGKILL);
+  waitpid(holder, nullptr, 0);
+  EXPECT_TRUE(held) << "the 300 connections could not all be opened";
+  EXPECT_THAT(log(), HasSubstr("XPC Connection refused from 65534:65534 (uid:gid): the user holds "
+                               "32 connections\n"));
 }
 
 TEST_F(SourcesTest, ASendersOwnSenderUIDIsKept) {

@@ -79,8 +79,15 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
         return;
       }
       if (resolved && resolved->isDictionary()) {
+        // The details' keys are unique, so only the facility can share a name with one: the
+        // later value replaces it in place, as in event records.
+        const bool hasFacility = !attributes.empty();
         for (const auto& [key, value] : resolved->dictionary()) {
-          attributes.emplace_back(key, value.textForm());
+          if (hasFacility && key == attributes.front().first) {
+            attributes.front().second = value.textForm();
+          } else {
+            attributes.emplace_back(key, value.textForm());
+          }
         }
       }
     }
@@ -99,7 +106,7 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
 
 void LogToFile(const std::string& path, const std::string& message) {
   // Neither truncated nor appending: the seek to the end is what places the line.
-  const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+  const int fd = OpenLogDestination(path.c_str(), O_CREAT, 0644);
   if (fd < 0) {
     LogMessage(0, "LOG: Cannot open %s errno = %d", path.c_str(), errno);
     return;

@@ -80,6 +80,12 @@ TEST_F(LogActionTest, ReportsAFileThatCannotBeOpened) {
   Run(Dictionary{{"message", "m"}, {"logPath", dir_ + "/missing/out.log"}});
   EXPECT_NE(capture_.text().find("LOG: Cannot open " + dir_ + "/missing/out.log errno = 2\n"),
             std::string::npos);
+  // A FIFO is no log file: opened read-write, the daemon would be its own reader.
+  const std::string fifo = dir_ + "/fifo";
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  Run(Dictionary{{"message", "m"}, {"logPath", fifo}});
+  EXPECT_NE(capture_.text().find("LOG: Cannot open " + fifo + " errno = 6\n"), std::string::npos)
+      << capture_.text();
 }
 
 TEST_F(LogActionTest, SelectsTheStructuredLogByLogTypeInAnyCase) {
@@ -133,6 +139,16 @@ TEST_F(LogActionTest, SendsKvlogDetailsAndALiteralFacilityWithTheMessageIntact) 
   const std::vector<std::pair<std::string, std::string>> expected = {
       {"Facility", "${global:who}"}, {"user", "root"}, {"n", "2"}};
   EXPECT_EQ(records[0].attributes, expected);
+
+  // A detail named like the facility attribute replaces it: one attribute per name.
+  Run(Dictionary{{"message", "m"},
+                 {"logType", "kvlog"},
+                 {"facility", "f"},
+                 {"details", Dictionary{{"a", "1"}, {"Facility", "${global:who}"}}}});
+  ASSERT_EQ(Records().size(), 2u);
+  const std::vector<std::pair<std::string, std::string>> replaced = {{"Facility", "root"},
+                                                                     {"a", "1"}};
+  EXPECT_EQ(Records()[1].attributes, replaced);
 }
 
 TEST_F(LogActionTest, RefusesKvlogDetailsThatAreNoDictionaryButSyslogIgnoresThem) {

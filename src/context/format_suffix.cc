@@ -6,6 +6,8 @@
 #include <string>
 #include <vector>
 
+#include "platform/diagnostic_log.h"
+
 namespace tarvod {
 namespace {
 
@@ -240,7 +242,18 @@ std::optional<plist::Value> ApplyFormatSuffix(const std::optional<plist::Value>&
   if (suffix.empty() || (value && HasNoNumber(*value))) return value;
   const double number = value ? value->numberValue() : 0.0;
   // Dates are shown in UTC, like the text form of every other date the daemon writes.
-  if (suffix == "%t") return plist::Value(plist::FormatDate(plist::Date{number}, false));
+  if (suffix == "%t") {
+    // A date the calendar text cannot show is refused like any suffix that does not apply,
+    // rather than shown as some other date.
+    if (!plist::IsFormattableDate(plist::Date{number})) {
+      LogMessage(1,
+                 "ApplyFormatSuffix: %.17g seconds since 2001 lie outside the years 1 to 9999; "
+                 "%%t not applied",
+                 number);
+      return value;
+    }
+    return plist::Value(plist::FormatDate(plist::Date{number}, false));
+  }
   if (suffix == "%m") return plist::Value(ByteAmount(number));
   auto conversion = ParseConversion(suffix);
   if (!conversion) return value;

@@ -2,7 +2,10 @@
 
 #include <gtest/gtest.h>
 
+#include <cmath>
 #include <string>
+
+#include "platform/testing/log_capture.h"
 
 namespace tarvod {
 namespace {
@@ -86,6 +89,29 @@ TEST(FormatSuffix, TimeSuffixShowsSecondsSince2001AsAUtcDate) {
   EXPECT_EQ(Text(ApplyFormatSuffix(Value::Real(86400 + 3661.5), "%t")),
             "2001-01-02 01:01:01 +0000");
   EXPECT_EQ(Text(ApplyFormatSuffix(Value::FromDate({60}), "%t")), "2001-01-01 00:01:00 +0000");
+  EXPECT_EQ(Text(ApplyFormatSuffix(Value::Integer(-63113904000), "%t")),
+            "0001-01-01 00:00:00 +0000");
+  EXPECT_EQ(Text(ApplyFormatSuffix(Value::Integer(252423993599), "%t")),
+            "9999-12-31 23:59:59 +0000");
+}
+
+TEST(FormatSuffix, TimeSuffixRefusesDatesOutsideTheYears1To9999) {
+  testing::LogCapture capture(1);
+  const Value outside[] = {Value::Integer(252423993600), Value::Real(1e12),
+                           Value::Integer(-63113904001), Value::FromDate({-1e15}),
+                           Value::Real(std::nan("")),    Value::Real(HUGE_VAL)};
+  for (const Value& value : outside) {
+    SCOPED_TRACE(Describe(value));
+    const auto result = ApplyFormatSuffix(value, "%t");
+    ASSERT_TRUE(result);
+    EXPECT_EQ(*result, value);
+  }
+  const std::string log = capture.text();
+  EXPECT_NE(log.find("ApplyFormatSuffix: 252423993600 seconds since 2001 lie outside the years 1 "
+                     "to 9999; %t not applied\n"),
+            std::string::npos)
+      << log;
+  EXPECT_NE(log.find("ApplyFormatSuffix: inf seconds"), std::string::npos) << log;
 }
 
 TEST(FormatSuffix, ByteAmountsReadInBinaryUnitsWithOneDecimal) {

@@ -15,33 +15,6 @@ constexpr std::string_view kEventPrefix = "event:";
 constexpr std::string_view kKeychainPrefix = "keychain:";
 constexpr std::string_view kGlobalPrefix = "global:";
 
-// White space and line breaks beyond ASCII, in UTF-8: the Unicode space separators, the
-// next-line character and the line and paragraph separators.
-constexpr std::string_view kUnicodeSpaces[] = {
-    "\u0085", "\u00a0", "\u1680", "\u2000", "\u2001", "\u2002", "\u2003",
-    "\u2004", "\u2005", "\u2006", "\u2007", "\u2008", "\u2009", "\u200a",
-    "\u2028", "\u2029", "\u202f", "\u205f", "\u3000",
-};
-
-bool IsAsciiSpace(char c) { return c == ' ' || (c >= '\t' && c <= '\r'); }
-
-// Byte length of the white space or line break that text begins with (ends with, when
-// atEnd), 0 when there is none.
-size_t SpaceLength(std::string_view text, bool atEnd) {
-  if (text.empty()) return 0;
-  if (IsAsciiSpace(atEnd ? text.back() : text.front())) return 1;
-  for (const std::string_view space : kUnicodeSpaces) {
-    if (atEnd ? text.ends_with(space) : text.starts_with(space)) return space.size();
-  }
-  return 0;
-}
-
-std::string_view Trim(std::string_view text) {
-  while (const size_t length = SpaceLength(text, false)) text.remove_prefix(length);
-  while (const size_t length = SpaceLength(text, true)) text.remove_suffix(length);
-  return text;
-}
-
 std::optional<plist::Value> ValueIn(const plist::Dictionary* dictionary, std::string_view key) {
   if (dictionary == nullptr) return std::nullopt;
   const plist::Value* value = dictionary->find(key);
@@ -73,8 +46,8 @@ std::optional<plist::Value> Context::variableValueForKey(std::string_view refere
   std::string_view name = reference;
   std::string_view suffix;
   if (const size_t percent = reference.rfind('%'); percent != std::string_view::npos) {
-    name = Trim(reference.substr(0, percent));
-    suffix = Trim(reference.substr(percent));
+    name = plist::TrimSpace(reference.substr(0, percent));
+    suffix = plist::TrimSpace(reference.substr(percent));
   }
 
   // The first matching namespace decides; there is no fallback between them, so a plain name

@@ -7,6 +7,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <string>
@@ -31,8 +32,9 @@ struct RulebaseEntry {
   mutable std::atomic<double> lastEventTimestamp{0.0};
 };
 
-// Event type to entry. std::map keeps entries at stable addresses.
-using Rulebase = std::map<std::string, RulebaseEntry>;
+// Event type to entry. std::map keeps entries at stable addresses; the transparent comparison
+// lets dispatch look up the prefixes of a type without copying them.
+using Rulebase = std::map<std::string, RulebaseEntry, std::less<>>;
 using RulebasePtr = std::shared_ptr<const Rulebase>;
 
 // The rulebase as a property-list value: { type = { rules = (...); eventCounter = n;

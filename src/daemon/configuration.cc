@@ -21,9 +21,10 @@ void LoadConfiguration(const std::string& path, plist::Dictionary* globals,
   }
 }
 
-int64_t ConfigurationInteger(const plist::Dictionary& configuration, std::string_view key) {
+int64_t ConfigurationInteger(const plist::Dictionary& configuration, std::string_view key,
+                             int64_t fallback) {
   const plist::Value* value = configuration.find(key);
-  return value ? value->integerValue() : 0;
+  return value ? value->integerValue() : fallback;
 }
 
 std::string ConfigurationString(const plist::Dictionary& configuration, std::string_view key,

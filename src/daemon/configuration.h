@@ -17,9 +17,10 @@ inline constexpr const char* kDefaultRulesPath = "/etc/tarvod.d/rules/";
 void LoadConfiguration(const std::string& path, plist::Dictionary* globals,
                        plist::Dictionary* configuration);
 
-// A configuration value read as an integer (numbers, booleans and numeric strings); 0 when
-// the key is absent.
-int64_t ConfigurationInteger(const plist::Dictionary& configuration, std::string_view key);
+// A configuration value read as an integer (numbers, booleans and numeric strings); fallback
+// when the key is absent.
+int64_t ConfigurationInteger(const plist::Dictionary& configuration, std::string_view key,
+                             int64_t fallback = 0);
 // A configuration value that must be a string; fallback when absent or of another kind.
 std::string ConfigurationString(const plist::Dictionary& configuration, std::string_view key,
                                 std::string_view fallback = {});

@@ -116,6 +116,10 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   // The journal cursor lives beside the saved state, so that a restart resumes where it was.
   if (authLogSource == "journal") mFiles.makeDirectories(stateDirectory, 0700);
   mMonitor->setAuthLogSource(authLogSource, stateDirectory + "/journal_cursor");
+  mMonitor->setConnectionIdleTimeout(
+      ConfigurationInteger(mConfiguration, "connectionIdleTimeout", kDefaultConnectionIdleTimeout));
+  mMonitor->setMaxConnectionsPerUID(
+      ConfigurationInteger(mConfiguration, "maxConnectionsPerUID", kDefaultMaxConnectionsPerUID));
   mMonitor->setEventFilterUID(FilterList(mConfiguration, "filterByUID"),
                               FilterList(mConfiguration, "filterByGID"));
   mEngine->postStartupEvent(false);

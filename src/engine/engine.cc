@@ -1,9 +1,11 @@
 #include "engine/engine.h"
 
+#include <algorithm>
 #include <atomic>
 #include <filesystem>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "context/context.h"
@@ -16,21 +18,26 @@
 namespace tarvod {
 namespace {
 
-// The prefixes of a type, longest first: "a.b.c", "a.b", "a". Empty components count, so
-// "a..b" yields "a..b", "a.", "a".
-std::vector<std::string> TypePrefixes(const std::string& type) {
-  std::vector<std::string> prefixes{type};
-  for (size_t dot = type.rfind('.'); dot != std::string::npos;
-       dot = dot == 0 ? std::string::npos : type.rfind('.', dot - 1)) {
+// Longer event types are malformed events: every prefix of a type is looked up and logged,
+// so its size bounds the work one event can cause.
+constexpr size_t kMaxEventTypeBytes = 1024;
+constexpr size_t kMaxEventTypeComponents = 64;
+
+// The prefixes of a type, longest first: "a.b.c", "a.b", "a", as views of the type itself.
+// Empty components count, so "a..b" yields "a..b", "a.", "a".
+std::vector<std::string_view> TypePrefixes(std::string_view type) {
+  std::vector<std::string_view> prefixes{type};
+  for (size_t dot = type.rfind('.'); dot != std::string_view::npos;
+       dot = dot == 0 ? std::string_view::npos : type.rfind('.', dot - 1)) {
     prefixes.push_back(type.substr(0, dot));
   }
   return prefixes;
 }
 
-void QueuePrefix(SerialQueue& queue, double now, const std::string& prefix,
+void QueuePrefix(SerialQueue& queue, double now, std::string_view prefix,
                  const RulebaseEntry& entry, const std::shared_ptr<const plist::Dictionary>& event,
                  const RulebasePtr& rulebase, const VariableStorePtr& variables) {
-  LogMessage(2, "  Processing event: %s", prefix.c_str());
+  LogMessage(2, "  Processing event: %.*s", static_cast<int>(prefix.size()), prefix.data());
   auto context = std::make_shared<Context>(variables, rulebase, *event);
 
   // The counter runs in the rulebase entry, so "prefix:eventCounter" counts the events of
@@ -38,9 +45,10 @@ void QueuePrefix(SerialQueue& queue, double now, const std::string& prefix,
   // context's copy is the count including this event.
   const uint64_t count = entry.eventCounter.fetch_add(1, std::memory_order_relaxed) + 1;
   entry.lastEventTimestamp.store(now, std::memory_order_relaxed);
-  context->eventMetadata().set(prefix + ":eventCounter",
+  const std::string name(prefix);
+  context->eventMetadata().set(name + ":eventCounter",
                                plist::Value::Integer(static_cast<int64_t>(count)));
-  context->eventMetadata().set(prefix + ":lastEventTimestamp", plist::Value::Real(now));
+  context->eventMetadata().set(name + ":lastEventTimestamp", plist::Value::Real(now));
 
   // Each job holds its own reference to its rule; the context keeps the rulebase alive.
   const std::vector<RulePtr>& rules = entry.rules;
@@ -93,8 +101,16 @@ void Engine::dispatchEvent(const plist::Dictionary& event) {
   if (!mDispatchOpen.load()) return;
   const plist::Value* typeValue = event.find("eventType");
   if (typeValue == nullptr) return;
-  LogEvent(event);
   const std::string type = typeValue->textForm();
+  const size_t components = std::count(type.begin(), type.end(), '.') + size_t{1};
+  if (type.size() > kMaxEventTypeBytes || components > kMaxEventTypeComponents) {
+    LogMessage(1,
+               "DispatchEvent: dropping an event whose type has %zu bytes and %zu components "
+               "(at most %zu and %zu)",
+               type.size(), components, kMaxEventTypeBytes, kMaxEventTypeComponents);
+    return;
+  }
+  LogEvent(event);
   LogMessage(1, "EVENT RECEIVED: %s", type.c_str());
 
   const RulebasePtr rulebase = mRulebase.load();
@@ -102,7 +118,7 @@ void Engine::dispatchEvent(const plist::Dictionary& event) {
   // One copy of the event, made when a prefix first has rules and shared by every record job
   // of this dispatch.
   std::shared_ptr<const plist::Dictionary> shared;
-  for (const std::string& prefix : TypePrefixes(type)) {
+  for (const std::string_view prefix : TypePrefixes(type)) {
     auto found = rulebase->find(prefix);
     if (found != rulebase->end()) {
       if (!shared) shared = std::make_shared<const plist::Dictionary>(event);
@@ -110,7 +126,8 @@ void Engine::dispatchEvent(const plist::Dictionary& event) {
       continue;
     }
     if (prefix.size() == type.size()) WriteEventRecord(event, false, false);
-    LogMessage(2, "  Dropping event %s because it has no associated rules", prefix.c_str());
+    LogMessage(2, "  Dropping event %.*s because it has no associated rules",
+               static_cast<int>(prefix.size()), prefix.data());
   }
 }
 

@@ -151,5 +151,44 @@ TEST_F(EngineTest, EmptyComponentsOfATypeArePrefixesAndATypelessEventLeavesNoTra
   EXPECT_EQ(testing::ReadJsonRecords(records_).size(), 2u);
 }
 
+TEST_F(EngineTest, TypesBeyondTheLimitsAreDroppedWithOneMessage) {
+  SetDebugLevel(1);
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)["a"].rules = {CountingRule("a")};
+  engine_.swapRulebase(rulebase);
+  auto repeated = [](const std::string& piece, size_t times) {
+    std::string text;
+    for (size_t i = 0; i < times; ++i) text += piece;
+    return text;
+  };
+  const struct {
+    std::string type;
+    bool runs;
+  } cases[] = {
+      {"a" + repeated(".b", 63), true},           // 64 components
+      {"a" + repeated(".b", 64), false},          // 65
+      {"a." + std::string(1022, 'b'), true},      // 1,024 bytes
+      {"a." + std::string(1023, 'b'), false},     // 1,025
+      {"a" + repeated(".a", 60'000 - 1), false},  // 120 KB of "a."
+  };
+  int64_t expected = 0;
+  for (const auto& c : cases) {
+    engine_.dispatchEvent({{"eventType", c.type}});
+    expected += c.runs ? 1 : 0;
+  }
+  EXPECT_EQ(Count(engine_), expected);
+  // Two records for each event that ran (its full type and "a"), none for a dropped one.
+  EXPECT_EQ(testing::ReadJsonRecords(records_).size(), 2u * static_cast<size_t>(expected));
+  const std::string log = capture_.text();
+  size_t dropped = 0;
+  for (size_t at = log.find("DispatchEvent: dropping"); at != std::string::npos;
+       at = log.find("DispatchEvent: dropping", at + 1)) {
+    ++dropped;
+  }
+  EXPECT_EQ(dropped, 3u) << log;
+  EXPECT_NE(log.find("has 119999 bytes and 60000 components (at most 1024 and 64)"),
+            std::string::npos);
+}
+
 }  // namespace
 }  // namespace tarvod

@@ -67,9 +67,14 @@ size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables,
     }
     auto rule = std::make_shared<const Rule>(std::move(*source));
     for (const plist::Value& type : types) {
-      // Types are matched as exact strings; anything else in the list cannot match an event.
-      const std::string key = type.textForm();
-      rulebase[key].rules.push_back(rule);
+      // Types are matched as exact strings. Anything else in the list is skipped: indexed
+      // under its text form, 5 or a nested array would match events of that type.
+      if (!type.isString()) {
+        LogMessage(1, "  Skipping event type %s of rule %s: not a string",
+                   plist::Describe(type).c_str(), name.c_str());
+        continue;
+      }
+      rulebase[type.string()].rules.push_back(rule);
       LogMessage(3, "  Added rule: %s", name.c_str());
     }
     ++accepted;

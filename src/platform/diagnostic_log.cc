@@ -117,6 +117,15 @@ void StopSummaryWriter(ErrorLog& log) {
 
 ErrorLog::~ErrorLog() { StopSummaryWriter(*this); }
 
+constexpr int kLogOpenFlags = O_WRONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
+
+bool IsLogDestination(const struct stat& file) {
+  if (S_ISREG(file.st_mode)) return true;
+  struct stat null {};
+  return S_ISCHR(file.st_mode) && stat("/dev/null", &null) == 0 && S_ISCHR(null.st_mode) &&
+         file.st_rdev == null.st_rdev;
+}
+
 }  // namespace
 
 void SetDebugLevel(int64_t level) { gDebugLevel.store(level, std::memory_order_relaxed); }
@@ -169,13 +178,31 @@ void ConsoleMessage(const char* format, ...) {
   WriteFully(STDERR_FILENO, line.data(), line.size());
 }
 
+int OpenLogDestination(const char* path, int flags, mode_t mode) {
+  const int fd = open(path, flags | kLogOpenFlags, mode);
+  if (fd < 0) return -1;
+  struct stat opened {};
+  if (fstat(fd, &opened) != 0 || !IsLogDestination(opened)) {
+    close(fd);
+    errno = EINVAL;
+    return -1;
+  }
+  return fd;
+}
+
 int SafeOpen(const char* path, mode_t mode, int flags) {
   struct stat before {};
   if (lstat(path, &before) != 0) {
     if (errno != ENOENT) return -1;
-    return open(path, flags | O_CREAT | O_EXCL | O_CLOEXEC, mode);
+    return open(path, flags | kLogOpenFlags | O_CREAT | O_EXCL, mode);
   }
-  const int fd = open(path, flags | O_CLOEXEC, mode);
+  // Checked before the open too, since opening a device can have effects of its own; a link
+  // is refused below, as a swapped file.
+  if (!S_ISLNK(before.st_mode) && !IsLogDestination(before)) {
+    errno = EINVAL;
+    return -1;
+  }
+  const int fd = open(path, flags | kLogOpenFlags, mode);
   if (fd < 0) return -1;
   struct stat after {};
   if (fstat(fd, &after) != 0 || after.st_mode != before.st_mode || after.st_ino != before.st_ino ||

@@ -34,10 +34,19 @@ int64_t DebugLevel();
 // Writes one line to standard error (the console log of log set-up).
 void ConsoleMessage(const char* format, ...) __attribute__((format(printf, 1, 2)));
 
-// Opens path without following a link planted there: a missing path is created exclusively
-// with mode; an existing one is opened with flags and accepted only when the opened file is
-// the one lstat saw (same mode, inode and device). Returns the descriptor, or -1 with errno
-// set (EACCES for a link or a swapped file).
+// Every log destination is opened write-only and non-blocking, so that neither a FIFO (whose
+// reader would be the daemon itself, or nobody) nor a device can hold a thread up, and is
+// accepted only when it is a regular file or /dev/null.
+
+// Opens path as a log destination with the extra flags (O_CREAT, O_APPEND, O_NOFOLLOW) and
+// mode. Returns the descriptor, or -1 with errno set (EINVAL for anything but a regular file
+// or /dev/null; ENXIO for a FIFO nobody reads).
+int OpenLogDestination(const char* path, int flags, mode_t mode);
+
+// Opens path as a log destination without following a link planted there: a missing path is
+// created exclusively with mode; an existing one is opened with flags and accepted only when
+// the opened file is the one lstat saw (same mode, inode and device). Returns the descriptor,
+// or -1 with errno set (EACCES for a link or a swapped file, EINVAL as OpenLogDestination).
 int SafeOpen(const char* path, mode_t mode, int flags);
 
 // Take ownership of an open, appending descriptor as the error log / event log.

@@ -130,5 +130,41 @@ TEST_F(DiagnosticLogTest, SafeOpenRefusesLinksAndAcceptsHardLinks) {
   EXPECT_EQ(st.st_mode & 0777, 0600u);
 }
 
+TEST_F(DiagnosticLogTest, LogDestinationsMustBeRegularFilesOrDevNull) {
+  const std::string lonelyFifo = dir_ + "/lonely";
+  const std::string readFifo = dir_ + "/read";
+  const std::string regular = dir_ + "/regular";
+  ASSERT_EQ(mkfifo(lonelyFifo.c_str(), 0600), 0);
+  ASSERT_EQ(mkfifo(readFifo.c_str(), 0600), 0);
+  // A reader that is not the daemon: opening the FIFO for writing would then succeed at once.
+  const int reader = open(readFifo.c_str(), O_RDONLY | O_NONBLOCK);
+  ASSERT_GE(reader, 0);
+  const struct {
+    std::string path;
+    int error;  // 0: accepted
+  } cases[] = {
+      {regular, 0},       {"/dev/null", 0}, {lonelyFifo, ENXIO},
+      {readFifo, EINVAL}, {dir_, EISDIR},   {"/dev/zero", EINVAL},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.path);
+    for (const bool safe : {false, true}) {
+      errno = 0;
+      const int fd = safe ? SafeOpen(c.path.c_str(), 0600, O_APPEND)
+                          : OpenLogDestination(c.path.c_str(), O_CREAT | O_APPEND, 0600);
+      EXPECT_EQ(fd >= 0, c.error == 0);
+      if (fd < 0) {
+        // SafeOpen refuses what is no regular file before opening it.
+        EXPECT_EQ(errno, safe ? EINVAL : c.error);
+      } else {
+        // Write-only: nothing the daemon writes can come back to it.
+        EXPECT_EQ(fcntl(fd, F_GETFL) & O_ACCMODE, O_WRONLY);
+        close(fd);
+      }
+    }
+  }
+  close(reader);
+}
+
 }  // namespace
 }  // namespace tarvod

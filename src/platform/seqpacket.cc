@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/uio.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -107,7 +108,19 @@ void RemoveSeqpacketPath(const std::string& path, const SocketResult& listener) 
 }
 
 int AcceptSeqpacket(int listenFd) {
-  return accept4(listenFd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
+  const int fd = accept4(listenFd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
+  if (fd < 0) return -1;
+  // With credentials passed, every packet, even an empty one, arrives with a control message,
+  // and the end of the connection without one: both read as zero bytes otherwise. Packets
+  // queued before this call get theirs too.
+  const int on = 1;
+  if (setsockopt(fd, SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0) {
+    const int error = errno;
+    close(fd);
+    errno = error;
+    return -1;
+  }
+  return fd;
 }
 
 bool ReadPeerCredentials(int fd, PeerCredentials* credentials) {
@@ -121,9 +134,16 @@ bool ReadPeerCredentials(int fd, PeerCredentials* credentials) {
 }
 
 ReceiveStatus ReceivePacket(int fd, std::vector<uint8_t>& buffer, size_t* length) {
-  // MSG_TRUNC makes recv return the packet's real length, so an oversize packet is seen as
+  iovec data{buffer.data(), buffer.size()};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(ucred))];
+  msghdr message{};
+  message.msg_iov = &data;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof control;
+  // MSG_TRUNC makes recvmsg return the packet's real length, so an oversize packet is seen as
   // such (and discarded whole) instead of being cut into a valid-looking prefix.
-  const ssize_t got = recv(fd, buffer.data(), buffer.size(), MSG_TRUNC | MSG_DONTWAIT);
+  const ssize_t got = recvmsg(fd, &message, MSG_TRUNC | MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
   if (got < 0) {
     if (errno == EAGAIN || errno == EWOULDBLOCK || errno == EINTR)
       return ReceiveStatus::kWouldBlock;
@@ -131,9 +151,17 @@ ReceiveStatus ReceivePacket(int fd, std::vector<uint8_t>& buffer, size_t* length
     return ReceiveStatus::kError;
   }
   *length = static_cast<size_t>(got);
-  if (got == 0) return ReceiveStatus::kEmpty;
+  // A packet carries the sender's credentials (see AcceptSeqpacket); the end does not.
+  if (got == 0) {
+    return CMSG_FIRSTHDR(&message) != nullptr ? ReceiveStatus::kEmpty : ReceiveStatus::kClosed;
+  }
   if (*length > buffer.size()) return ReceiveStatus::kOversize;
   return ReceiveStatus::kMessage;
+}
+
+bool PacketPending(int fd) {
+  char byte;
+  return recv(fd, &byte, sizeof byte, MSG_PEEK | MSG_DONTWAIT) >= 0;
 }
 
 SocketResult ConnectSeqpacket(const std::string& path) {

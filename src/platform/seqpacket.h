@@ -30,7 +30,8 @@ SocketResult ListenSeqpacket(const std::string& path, int backlog);
 // Removes the socket file at path when it is still the one ListenSeqpacket created.
 void RemoveSeqpacketPath(const std::string& path, const SocketResult& listener);
 
-// Accepts one connection, non-blocking and close-on-exec; -1 with errno set.
+// Accepts one connection, non-blocking and close-on-exec, set up for ReceivePacket to tell an
+// empty packet from the end of the connection; -1 with errno set.
 int AcceptSeqpacket(int listenFd);
 
 struct PeerCredentials {
@@ -43,12 +44,16 @@ bool ReadPeerCredentials(int fd, PeerCredentials* credentials);
 enum class ReceiveStatus {
   kMessage,     // *length bytes are in the buffer
   kOversize,    // a packet longer than the buffer arrived and was discarded; *length is its size
-  kEmpty,       // a zero-length read: an empty packet, or the peer has gone (see the hang-up flags)
+  kEmpty,       // an empty packet
+  kClosed,      // the peer has closed, and every packet it sent has been received
   kWouldBlock,  // nothing pending
   kError,       // the connection failed; errno is in *length
 };
-// Receives exactly one packet into buffer (whose size is the limit).
+// Receives exactly one packet into buffer (whose size is the limit), on a descriptor from
+// AcceptSeqpacket.
 ReceiveStatus ReceivePacket(int fd, std::vector<uint8_t>& buffer, size_t* length);
+// Whether a packet, or the end of the connection, waits to be received.
+bool PacketPending(int fd);
 
 // Connects to the socket at path (blocking); the error names the path and the reason.
 SocketResult ConnectSeqpacket(const std::string& path);

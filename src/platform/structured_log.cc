@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <sys/uio.h>
 
+#include "platform/diagnostic_log.h"
 #include "plist/value.h"
 // The records carry the daemon's own fields only, not the source location of this file.
 #define SD_JOURNAL_SUPPRESS_LOCATION
@@ -92,8 +93,7 @@ class JsonLinesLog final : public StructuredLog {
     // One lock around open and write keeps lines from interleaving; the file is opened per
     // record so that it can be rotated away underneath the daemon.
     std::lock_guard<std::mutex> guard(mLock);
-    const int fd =
-        open(mPath.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW, 0644);
+    const int fd = OpenLogDestination(mPath.c_str(), O_CREAT | O_APPEND | O_NOFOLLOW, 0644);
     if (fd < 0) return false;
     size_t written = 0;
     while (written < line.size()) {

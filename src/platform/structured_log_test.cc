@@ -110,6 +110,11 @@ TEST_F(JsonLinesSink, CreatesTheFileWithMode0644AndAppendsToExistingContent) {
 TEST_F(JsonLinesSink, ReportsAFileThatCannotBeOpened) {
   ConfigureStructuredLog(capture_.directory() + "/missing/records.jsonl");
   EXPECT_FALSE(DefaultStructuredLog().send(5, "m", {}));
+  // A FIFO nobody reads fails at once instead of waiting for a reader.
+  const std::string fifo = capture_.directory() + "/fifo";
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  ConfigureStructuredLog(fifo);
+  EXPECT_FALSE(DefaultStructuredLog().send(5, "m", {}));
 }
 
 TEST_F(JsonLinesSink, KeepsLinesWholeWhenTwoThreadsSendAtOnce) {

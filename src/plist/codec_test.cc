@@ -178,6 +178,10 @@ TEST(PropertyListText, RoundTripsEveryKindThroughDescribe) {
   for (const auto& [key, item] : value.dictionary()) {
     EXPECT_EQ(ParseTextPropertyList(Describe(item)), item) << Describe(item);
   }
+  // A string that begins like a binary list reads back as that string, not as a binary list.
+  for (const Value& text : {Value("bplist00"), Value("bplist00abc"), Value("bplist")}) {
+    EXPECT_EQ(ReadPropertyList(Describe(text)), text) << Describe(text);
+  }
 }
 
 TEST(PropertyListText, ReadsStringsTables) {

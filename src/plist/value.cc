@@ -46,10 +46,62 @@ Dictionary& Value::dictionary() { return std::get<internal::DictionaryBox>(v_).g
 
 namespace {
 
-bool IsSpace(char c) {
-  return c == ' ' || c == '\t' || c == '\n' || c == '\r' || c == '\f' || c == '\v';
-}
+// White space and line breaks beyond ASCII, in UTF-8: the Unicode space separators, the
+// next-line character and the line and paragraph separators.
+constexpr std::string_view kUnicodeSpaces[] = {
+    "\u0085", "\u00a0", "\u1680", "\u2000", "\u2001", "\u2002", "\u2003",
+    "\u2004", "\u2005", "\u2006", "\u2007", "\u2008", "\u2009", "\u200a",
+    "\u2028", "\u2029", "\u202f", "\u205f", "\u3000",
+};
+
 bool IsDigit(char c) { return c >= '0' && c <= '9'; }
+bool IsAsciiSpace(char c) { return c == ' ' || (c >= '\t' && c <= '\r'); }
+
+// Where the text starts once its leading white space is skipped.
+size_t SkipSpace(std::string_view text) {
+  size_t i = 0;
+  while (const size_t length = SpaceLength(text.substr(i), false)) i += length;
+  return i;
+}
+
+// The decimal exponent of the first significant digit of a number text that from_chars found
+// out of range ("0.00123e-400" gives -403): with it, overflow and underflow are told apart
+// by the value the text spells rather than by how the exponent is written.
+int64_t DecimalExponent(std::string_view text) {
+  size_t i = 0;
+  if (i < text.size() && (text[i] == '+' || text[i] == '-')) ++i;
+  int64_t position = 0;
+  bool significant = false;
+  for (; i < text.size() && IsDigit(text[i]); ++i) {
+    if (significant) {
+      ++position;
+    } else if (text[i] != '0') {
+      significant = true;
+    }
+  }
+  if (i < text.size() && text[i] == '.') {
+    int64_t place = 0;
+    for (++i; i < text.size() && IsDigit(text[i]); ++i) {
+      --place;
+      if (!significant && text[i] != '0') {
+        significant = true;
+        position = place;
+      }
+    }
+  }
+  int64_t exponent = 0;
+  if (i < text.size() && (text[i] == 'e' || text[i] == 'E')) {
+    ++i;
+    const bool negative = i < text.size() && text[i] == '-';
+    if (i < text.size() && (text[i] == '+' || text[i] == '-')) ++i;
+    // Saturates far beyond any double's range, long before int64 would overflow.
+    for (; i < text.size() && IsDigit(text[i]); ++i) {
+      if (exponent < 1'000'000'000) exponent = exponent * 10 + (text[i] - '0');
+    }
+    if (negative) exponent = -exponent;
+  }
+  return position + exponent;
+}
 
 int64_t ClampToInt64(double d) {
   if (std::isnan(d)) return 0;
@@ -60,9 +112,23 @@ int64_t ClampToInt64(double d) {
 
 }  // namespace
 
+size_t SpaceLength(std::string_view text, bool atEnd) {
+  if (text.empty()) return 0;
+  if (IsAsciiSpace(atEnd ? text.back() : text.front())) return 1;
+  for (const std::string_view space : kUnicodeSpaces) {
+    if (atEnd ? text.ends_with(space) : text.starts_with(space)) return space.size();
+  }
+  return 0;
+}
+
+std::string_view TrimSpace(std::string_view text) {
+  while (const size_t length = SpaceLength(text, false)) text.remove_prefix(length);
+  while (const size_t length = SpaceLength(text, true)) text.remove_suffix(length);
+  return text;
+}
+
 double LeadingNumber(std::string_view text) {
-  size_t i = 0;
-  while (i < text.size() && IsSpace(text[i])) ++i;
+  size_t i = SkipSpace(text);
   const size_t start = i;
   if (i < text.size() && (text[i] == '+' || text[i] == '-')) ++i;
   size_t digits = 0;
@@ -86,12 +152,11 @@ double LeadingNumber(std::string_view text) {
   double result = 0;
   auto [ptr, ec] = std::from_chars(text.data() + from, text.data() + i, result);
   if (ec == std::errc::result_out_of_range) {
-    // Overflow reads as infinity of the right sign, underflow as zero.
+    // Overflow reads as infinity of the right sign, underflow as zero. Every value from the
+    // smallest subnormal up to the largest double is in range, so a first significant digit
+    // at 10^0 or above means overflow.
     const bool negative = text[from] == '-';
-    std::string_view digitsText = text.substr(from, i - from);
-    const bool tiny = digitsText.find_first_of("eE") != std::string_view::npos &&
-                      digitsText.find("e-") != std::string_view::npos;
-    if (tiny) return negative ? -0.0 : 0.0;
+    if (DecimalExponent(text.substr(from, i - from)) < 0) return negative ? -0.0 : 0.0;
     return negative ? -std::numeric_limits<double>::infinity()
                     : std::numeric_limits<double>::infinity();
   }
@@ -100,8 +165,7 @@ double LeadingNumber(std::string_view text) {
 }
 
 int64_t LeadingInteger(std::string_view text) {
-  size_t i = 0;
-  while (i < text.size() && IsSpace(text[i])) ++i;
+  size_t i = SkipSpace(text);
   bool negative = false;
   if (i < text.size() && (text[i] == '+' || text[i] == '-')) negative = text[i++] == '-';
   uint64_t magnitude = 0;
@@ -165,8 +229,7 @@ bool Value::boolValue() const {
       return real() != 0.0;
     case Kind::kString: {
       const std::string& s = string();
-      size_t i = 0;
-      while (i < s.size() && IsSpace(s[i])) ++i;
+      const size_t i = SkipSpace(s);
       if (i < s.size() && (s[i] == 'Y' || s[i] == 'y' || s[i] == 'T' || s[i] == 't')) return true;
       return LeadingInteger(s) != 0;
     }
@@ -265,11 +328,15 @@ std::vector<std::string> Dictionary::sortedKeys() const {
   return keys;
 }
 
+bool IsFormattableDate(Date date) {
+  const double seconds = std::floor(date.secondsSince2001 + kUnixTimeOfReferenceDate);
+  // 0001-01-01 00:00:00 to 9999-12-31 23:59:59 UTC, in Unix seconds; NaN fails both.
+  return seconds >= -62135596800.0 && seconds <= 253402300799.0;
+}
+
 std::string FormatDate(Date date, bool localTime) {
   double seconds = std::floor(date.secondsSince2001 + kUnixTimeOfReferenceDate);
-  if (!std::isfinite(seconds) || seconds > 253402300799.0 || seconds < -62135596800.0) {
-    seconds = kUnixTimeOfReferenceDate;  // outside years 1 to 9999: show the reference date
-  }
+  if (!IsFormattableDate(date)) seconds = kUnixTimeOfReferenceDate;
   const time_t t = static_cast<time_t>(seconds);
   struct tm tm {};
   if (localTime) {
@@ -416,6 +483,8 @@ bool IsPlainWord(const std::string& s) {
   if (s == "true" || s == "false" || s == "nan" || s == "inf") return false;
   // "//" and "/*" would start a comment where a value is expected.
   if (s.starts_with("//")) return false;
+  // The binary property list's magic would make the whole text read back as a binary list.
+  if (s.starts_with("bplist")) return false;
   return std::all_of(s.begin(), s.end(), IsWordChar);
 }
 

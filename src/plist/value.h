@@ -175,7 +175,10 @@ std::string Describe(const Dictionary& dictionary);
 // text reader and JSON read back.
 void AppendEscapedString(std::string& out, std::string_view text);
 
-// Formats a date as "YYYY-MM-DD HH:MM:SS +HHMM" in the given zone (local time when true).
+// Whether FormatDate can show the date: a finite time in the years 1 to 9999 (UTC).
+bool IsFormattableDate(Date date);
+// Formats a date as "YYYY-MM-DD HH:MM:SS +HHMM" in the given zone (local time when true); a
+// date that is not formattable shows as the reference date.
 std::string FormatDate(Date date, bool localTime);
 // Reads a date back from FormatDate's form ("YYYY-MM-DD HH:MM:SS +HHMM", any zone offset) or
 // from the XML property-list form ("YYYY-MM-DDTHH:MM:SSZ"); years 1 to 9999. nullopt when the
@@ -186,7 +189,16 @@ std::optional<Date> ParseDate(std::string_view text);
 // U+10FFFF). Every string a reader returns has passed this test.
 bool IsValidUtf8(std::string_view text);
 
-// The leading decimal number / integer of a text, as numberValue and integerValue read it.
+// Byte length of the white space or line break that text begins with (ends with, when
+// atEnd), 0 when there is none: ASCII blanks and controls \t to \r, and in UTF-8 the Unicode
+// space separators, the next-line character and the line and paragraph separators.
+size_t SpaceLength(std::string_view text, bool atEnd);
+// text without the white space and line breaks at either end.
+std::string_view TrimSpace(std::string_view text);
+
+// The leading decimal number / integer of a text, as numberValue and integerValue read it,
+// after leading white space. A number too large for a double reads as infinity of its sign,
+// one too small as zero of its sign.
 double LeadingNumber(std::string_view text);
 int64_t LeadingInteger(std::string_view text);
 

@@ -113,6 +113,7 @@ TEST(IsValidUtf8, AcceptsOnlyWellFormedSequences) {
 }
 
 TEST(Value, ConvertsStringsToNumbersByTheirLeadingText) {
+  constexpr double kInf = std::numeric_limits<double>::infinity();
   struct Case {
     Value value;
     double number;
@@ -129,9 +130,21 @@ TEST(Value, ConvertsStringsToNumbersByTheirLeadingText) {
       {Value::Boolean(true), 1, 1, true},
       {Value::FromDate(Date{-2.5}), -2.5, -2, false},
       {Value(Array{Value::Integer(1)}), 0, 0, false},
+      // Out of range: the value decides, whatever the spelling of its exponent.
+      {Value("1E-400"), 0, 1, true},
+      {Value("-1E-400"), -0.0, -1, true},
+      {Value("0.0001e-320"), 0, 0, false},
+      {Value("1e400"), kInf, 1, true},
+      {Value("-0.5e310"), -kInf, 0, false},
+      {Value("1" + std::string(400, '0') + "e-10"), kInf, std::numeric_limits<int64_t>::max(),
+       true},
+      // Unicode white space is skipped like ASCII white space.
+      {Value("\u00a0\u3000 1000"), 1000, 1000, true},
+      {Value("\u2028-3"), -3, -3, true},
   };
   for (const Case& c : cases) {
     EXPECT_EQ(c.value.numberValue(), c.number) << Describe(c.value);
+    EXPECT_EQ(std::signbit(c.value.numberValue()), std::signbit(c.number)) << Describe(c.value);
     EXPECT_EQ(c.value.integerValue(), c.integer) << Describe(c.value);
     EXPECT_EQ(c.value.boolValue(), c.boolean) << Describe(c.value);
   }

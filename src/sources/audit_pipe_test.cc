@@ -7,40 +7,12 @@
 #include <vector>
 
 #include "sources/monitor.h"
+#include "sources/testing/bsm_bytes.h"
 
 namespace tarvod {
 namespace {
 
-using Bytes = std::vector<uint8_t>;
-
-struct RecordBuilder {
-  Bytes bytes;
-  RecordBuilder& put(uint64_t value, int width) {
-    for (int i = width - 1; i >= 0; --i) bytes.push_back(static_cast<uint8_t>(value >> (8 * i)));
-    return *this;
-  }
-  RecordBuilder& raw(const Bytes& b) {
-    bytes.insert(bytes.end(), b.begin(), b.end());
-    return *this;
-  }
-  RecordBuilder& header32(uint16_t event) {
-    return put(0x14, 1).put(0, 4).put(11, 1).put(event, 2).put(0, 2).put(0, 4).put(0, 4);
-  }
-  RecordBuilder& subject(uint32_t type, const Bytes& address) {
-    put(0x7a, 1);
-    for (int i = 0; i < 8; ++i) put(1000 + i, 4);  // audit, effective, real IDs; pid, sid, port
-    return put(type, 4).raw(address);
-  }
-  RecordBuilder& text(std::string_view s) {
-    put(0x28, 1).put(s.size() + 1, 2);
-    raw(Bytes(s.begin(), s.end()));
-    return put(0, 1);
-  }
-  RecordBuilder& ret(uint8_t status, uint32_t value) {
-    return put(0x27, 1).put(status, 1).put(value, 4);
-  }
-  RecordBuilder& trailer() { return put(0x13, 1).put(0xb105, 2).put(bytes.size() + 7, 4); }
-};
+using namespace ::tarvod::testing;
 
 Bytes Ipv4() { return {192, 0, 2, 7}; }
 Bytes Ipv6() { return {0x20, 0x01, 0x0d, 0xb8, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1}; }
@@ -84,9 +56,7 @@ std::vector<Case> Cases() {
   Bytes truncated = full(0).trailer().bytes;
   truncated.resize(truncated.size() - 9);  // stops inside the return token
   Bytes badText = RecordBuilder().header32(kSshLoginEvent).bytes;
-  RecordBuilder invalid;
-  invalid.put(0x28, 1).put(3, 2).raw({0xC3, 0x28, 0});
-  badText.insert(badText.end(), invalid.bytes.begin(), invalid.bytes.end());
+  badText = Cat({badText, MakeToken(0x28, Cat({U(3, 2), Bytes{0xC3, 0x28, 0}}))});
   return {
       {"failure with 255", full(255).trailer().bytes, "auth.failure", "192.0.2.7", "m"},
       {"failure with another value", full(1).bytes, "auth.failure", "192.0.2.7", "m"},
@@ -136,6 +106,22 @@ TEST(AuditRecord, ConvertsEveryKindOfRecordAsSpecified) {
     EXPECT_EQ(ip ? std::optional<std::string>(*ip) : std::nullopt, c.clientIP);
     const std::string* message = details.findString("message");
     EXPECT_EQ(message ? std::optional<std::string>(*message) : std::nullopt, c.message);
+  }
+}
+
+TEST(AuditRecord, ATokenOfAnyTypeBetweenHeaderAndReturnKeepsTheRecord) {
+  for (const auto& [name, token] : EveryTokenType()) {
+    SCOPED_TRACE(name);
+    const Bytes record = RecordBuilder()
+                             .header32(kSshLoginEvent)
+                             .subject(4, Ipv4())
+                             .raw(token)
+                             .ret(0, 0)
+                             .trailer()
+                             .bytes;
+    const auto event = AuditRecordToEvent(record);
+    ASSERT_TRUE(event);
+    EXPECT_EQ(*event->findString("eventType"), "auth.success");
   }
 }
 

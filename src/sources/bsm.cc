@@ -26,24 +26,42 @@ constexpr uint8_t kArg32 = 0x2d;      // number 1, value 4, text length 2, text
 constexpr uint8_t kSocket =
     0x2e;                        // type 2, local port 2, local address 4, remote port 2, address 4
 constexpr uint8_t kSeq = 0x2f;   // sequence 4
+constexpr uint8_t kAcl = 0x30;   // type 4, value 4, mode 4
 constexpr uint8_t kAttr = 0x31;  // mode 4, uid 4, gid 4, fsid 4, node 8, device 4
-constexpr uint8_t kIpcPerm = 0x32;     // 7 fields of 4
-constexpr uint8_t kGroups = 0x34;      // count 2, count IDs of 4
-constexpr uint8_t kPriv = 0x38;        // set name length 2, name, privileges length 2, privileges
-constexpr uint8_t kUpriv = 0x39;       // status 1, privilege length 2, privilege
-constexpr uint8_t kNewGroups = 0x3b;   // count 2, count IDs of 4
-constexpr uint8_t kExecArgs = 0x3c;    // count 4, count NUL-terminated strings
-constexpr uint8_t kExecEnv = 0x3d;     // as exec args
-constexpr uint8_t kAttr32 = 0x3e;      // as attr
-constexpr uint8_t kExit = 0x52;        // status 4, return 4
-constexpr uint8_t kZoneName = 0x60;    // length 2, name
-constexpr uint8_t kArg64 = 0x71;       // number 1, value 8, text length 2, text
-constexpr uint8_t kReturn64 = 0x72;    // status 1, value 8
-constexpr uint8_t kAttr64 = 0x73;      // mode 4, uid 4, gid 4, fsid 4, node 8, device 8
-constexpr uint8_t kHeader64 = 0x74;    // count 4, version 1, event 2, modifier 2, seconds 8, msec 8
-constexpr uint8_t kSubject64 = 0x75;   // 7 IDs of 4, port 8, address 4
-constexpr uint8_t kProcess64 = 0x77;   // as subject64
-constexpr uint8_t kHeader64Ex = 0x79;  // header64 with address type 4 and address
+constexpr uint8_t kIpcPerm = 0x32;    // 7 fields of 4
+constexpr uint8_t kLabel = 0x33;      // label ID 1, compartment count 1, class 2, 8 words of 4
+constexpr uint8_t kGroups = 0x34;     // count 2, count IDs of 4
+constexpr uint8_t kAce = 0x35;        // who 4, access mask 4, flags 2, type 2
+constexpr uint8_t kPriv = 0x38;       // set name length 2, name, privileges length 2, privileges
+constexpr uint8_t kUpriv = 0x39;      // status 1, privilege length 2, privilege
+constexpr uint8_t kLiaison = 0x3a;    // liaison 4
+constexpr uint8_t kNewGroups = 0x3b;  // count 2, count IDs of 4
+constexpr uint8_t kExecArgs = 0x3c;   // count 4, count NUL-terminated strings
+constexpr uint8_t kExecEnv = 0x3d;    // as exec args
+constexpr uint8_t kAttr32 = 0x3e;     // as attr
+constexpr uint8_t kUseOfAuth = 0x3f;  // length 2, authorization name
+constexpr uint8_t kXAtom = 0x40;      // length 2, atom name
+constexpr uint8_t kXSelect = 0x43;    // three counted strings: property, type, window data
+constexpr uint8_t kXColormap = 0x44;  // X object: XID 4, creator UID 4
+constexpr uint8_t kXCursor = 0x45;    // X object
+constexpr uint8_t kXFont = 0x46;      // X object
+constexpr uint8_t kXGc = 0x47;        // X object
+constexpr uint8_t kXPixmap = 0x48;    // X object
+constexpr uint8_t kXProperty = 0x49;  // XID 4, creator UID 4, length 2, property name
+constexpr uint8_t kXWindow = 0x4a;    // X object
+constexpr uint8_t kXClient = 0x4b;    // client ID 4
+constexpr uint8_t kCmd = 0x51;   // argument count 2, counted arguments, variable count 2, variables
+constexpr uint8_t kExit = 0x52;  // status 4, return 4
+constexpr uint8_t kZoneName = 0x60;   // length 2, name
+constexpr uint8_t kHost = 0x70;       // host address 4
+constexpr uint8_t kArg64 = 0x71;      // number 1, value 8, text length 2, text
+constexpr uint8_t kReturn64 = 0x72;   // status 1, value 8
+constexpr uint8_t kAttr64 = 0x73;     // mode 4, uid 4, gid 4, fsid 4, node 8, device 8
+constexpr uint8_t kHeader64 = 0x74;   // count 4, version 1, event 2, modifier 2, seconds 8, msec 8
+constexpr uint8_t kSubject64 = 0x75;  // 7 IDs of 4, port 8, address 4
+constexpr uint8_t kProcess64 = 0x77;  // as subject64
+constexpr uint8_t kOtherFile64 = 0x78;  // seconds 8, msec 8, name length 2, name
+constexpr uint8_t kHeader64Ex = 0x79;   // header64 with address type 4 and address
 constexpr uint8_t kProcess32Ex = 0x7b;  // as subject32 ex
 constexpr uint8_t kSubject64Ex = 0x7c;  // 7 IDs of 4, port 8, address type 4, address
 constexpr uint8_t kProcess64Ex = 0x7d;  // as subject64 ex
@@ -53,6 +71,10 @@ constexpr uint8_t kSocketEx =
 constexpr uint8_t kSockInet32 = 0x80;   // family 2, port 2, address 4
 constexpr uint8_t kSockInet128 = 0x81;  // family 2, port 2, address 16
 constexpr uint8_t kSockUnix = 0x82;     // family 2, NUL-terminated path of at most 104 bytes
+constexpr uint8_t kRights = 0x83;       // capability rights: 2 words of 8
+// Signer type 4; signing ID, its truncation flag 1, team ID, its truncation flag 1, code
+// directory hash, each of the three counted by a length 2.
+constexpr uint8_t kIdentity = 0xed;
 
 constexpr size_t kMaxUnixPath = 104;
 
@@ -155,6 +177,10 @@ std::optional<Token> FetchToken(std::span<const uint8_t> bytes) {
       reader.skip(4 + 4);
       reader.skip(reader.read(2));
       break;
+    case kOtherFile64:
+      reader.skip(8 + 8);
+      reader.skip(reader.read(2));
+      break;
     case kData: {
       reader.skip(1);  // how to print
       const uint64_t unit = reader.read(1);
@@ -171,6 +197,31 @@ std::optional<Token> FetchToken(std::span<const uint8_t> bytes) {
     case kXatPath:
     case kOpaque:
     case kZoneName:
+    case kUseOfAuth:
+    case kXAtom:
+      reader.skip(reader.read(2));
+      break;
+    case kXSelect:
+      for (int i = 0; i < 3; ++i) reader.skip(reader.read(2));
+      break;
+    case kXProperty:
+      reader.skip(4 + 4);
+      reader.skip(reader.read(2));
+      break;
+    case kCmd:
+      // Each of the two lists is a count and that many counted strings; each string takes at
+      // least its length field, which bounds the loops by the bytes present.
+      for (int list = 0; list < 2; ++list) {
+        const uint64_t count = reader.read(2);
+        for (uint64_t i = 0; i < count && reader.ok(); ++i) reader.skip(reader.read(2));
+      }
+      break;
+    case kIdentity:
+      reader.skip(4);
+      reader.skip(reader.read(2));
+      reader.skip(1);
+      reader.skip(reader.read(2));
+      reader.skip(1);
       reader.skip(reader.read(2));
       break;
     case kText: {
@@ -218,7 +269,28 @@ std::optional<Token> FetchToken(std::span<const uint8_t> bytes) {
       break;
     case kInAddr:
     case kSeq:
+    case kLiaison:
+    case kHost:
+    case kXClient:
       reader.skip(4);
+      break;
+    case kXColormap:
+    case kXCursor:
+    case kXFont:
+    case kXGc:
+    case kXPixmap:
+    case kXWindow:
+      reader.skip(4 + 4);
+      break;
+    case kAcl:
+    case kAce:
+      reader.skip(4 + 4 + 4);
+      break;
+    case kLabel:
+      reader.skip(1 + 1 + 2 + 8 * 4);
+      break;
+    case kRights:
+      reader.skip(2 * 8);
       break;
     case kInAddrEx:
       reader.readAddress(4, nullptr);

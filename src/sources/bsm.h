@@ -1,5 +1,6 @@
-// A decoder for the BSM audit record format: it knows the length of every token type so that
-// any record can be walked token by token, and decodes the fields of the four tokens the
+// A decoder for the BSM audit record format: it knows the length of every token type whose
+// layout is published (the Solaris, Trusted Extensions, OpenBSM, FreeBSD and Apple tokens) so
+// that any record can be walked token by token, and decodes the fields of the four tokens the
 // audit source uses. Pure functions over bytes; safe to call from any thread.
 #pragma once
 

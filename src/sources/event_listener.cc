@@ -3,7 +3,9 @@
 #include <sys/epoll.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <string_view>
 
@@ -34,6 +36,12 @@ bool LooksLikeWireFormat(std::string_view bytes) {
 // The IDs as the messages print them: "%d" of the 32-bit value.
 int AsPrinted(uint32_t id) { return static_cast<int32_t>(id); }
 
+uint64_t NowMicroseconds() {
+  return static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::microseconds>(
+                                   std::chrono::steady_clock::now().time_since_epoch())
+                                   .count());
+}
+
 }  // namespace
 
 std::optional<plist::Dictionary> ConvertXPCEvent(const plist::Dictionary& message, uint32_t uid,
@@ -54,6 +62,7 @@ struct PeerConnections::Peer {
   PeerCredentials credentials;
   std::unique_ptr<IoSource> source;
   bool cancelled = false;
+  uint64_t lastActivity = 0;  // when it connected or last sent a packet, in microseconds
 
   ~Peer() {
     source.reset();  // stop watching before the descriptor goes
@@ -66,11 +75,19 @@ PeerConnections::PeerConnections(Monitor& monitor, EventLoop& queue)
 
 PeerConnections::~PeerConnections() = default;
 
+bool PeerConnections::admits(uint32_t uid) const {
+  const int64_t limit = mMonitor.maxConnectionsPerUID();
+  if (uid == 0 || limit <= 0) return true;
+  const auto found = mPeersPerUID.find(uid);
+  return found == mPeersPerUID.end() || found->second < static_cast<size_t>(limit);
+}
+
 void PeerConnections::add(int fd, const PeerCredentials& credentials) {
   auto peer = std::make_unique<Peer>();
   peer->id = mNextId++;
   peer->fd = fd;
   peer->credentials = credentials;
+  peer->lastActivity = NowMicroseconds();
   Peer* raw = peer.get();
   peer->source = mQueue.addIo(fd, EPOLLIN | EPOLLRDHUP, /*gated=*/true,
                               [this, raw](uint32_t events) { onReadable(*raw, events); });
@@ -79,10 +96,53 @@ void PeerConnections::add(int fd, const PeerCredentials& credentials) {
     return;  // the descriptor closes with the peer
   }
   mPeers.emplace(peer->id, std::move(peer));
+  ++mPeersPerUID[credentials.uid];
+  scheduleIdleCheck();
 }
 
-void PeerConnections::onReadable(Peer& peer, uint32_t events) {
+void PeerConnections::scheduleIdleCheck() {
+  const int64_t timeout = mMonitor.connectionIdleTimeout();
+  if (mIdleCheckScheduled || timeout <= 0 || mPeers.empty()) return;
+  // The earliest moment a connection can have been idle for the whole timeout.
+  uint64_t oldest = UINT64_MAX;
+  for (const auto& [id, peer] : mPeers) {
+    if (!peer->cancelled) oldest = std::min(oldest, peer->lastActivity);
+  }
+  if (oldest == UINT64_MAX) return;
+  const uint64_t deadline = oldest + static_cast<uint64_t>(timeout) * 1'000'000;
+  const uint64_t now = NowMicroseconds();
+  mIdleCheckScheduled = mQueue.callLater(deadline > now ? deadline - now : 0,
+                                         [this, alive = std::weak_ptr<int>(mLifetime)] {
+                                           if (alive.expired()) return;
+                                           mIdleCheckScheduled = false;
+                                           closeIdlePeers();
+                                         });
+}
+
+void PeerConnections::closeIdlePeers() {
+  const int64_t timeout = mMonitor.connectionIdleTimeout();
+  if (timeout <= 0) return;
+  const uint64_t now = NowMicroseconds();
+  const uint64_t limit = static_cast<uint64_t>(timeout) * 1'000'000;
+  for (const auto& [id, peer] : mPeers) {
+    if (peer->cancelled || now - peer->lastActivity < limit) continue;
+    // A packet the daemon has not read yet (the read gate may be closed) is no idleness.
+    if (!mQueue.readGateOpen() || PacketPending(peer->fd)) {
+      peer->lastActivity = now;
+      continue;
+    }
+    LogMessage(1, "Closing the connection from %d:%d (uid:gid): nothing sent for %lld seconds",
+               AsPrinted(peer->credentials.uid), AsPrinted(peer->credentials.gid),
+               static_cast<long long>(timeout));
+    cancel(*peer);
+  }
+  scheduleIdleCheck();
+}
+
+void PeerConnections::onReadable(Peer& peer, uint32_t) {
   if (peer.cancelled) return;
+  // One packet per call: the loop calls again while more are queued, hang-up or not, so every
+  // packet a peer sent before closing is handled, and the read gate is looked at in between.
   size_t length = 0;
   switch (ReceivePacket(peer.fd, mBuffer, &length)) {
     case ReceiveStatus::kWouldBlock:
@@ -91,12 +151,11 @@ void PeerConnections::onReadable(Peer& peer, uint32_t events) {
       LogMessage(4, "peer error: %s", std::strerror(static_cast<int>(length)));
       cancel(peer);
       return;
+    case ReceiveStatus::kClosed:
+      LogMessage(4, "peer error: %s", "Connection invalid");
+      cancel(peer);
+      return;
     case ReceiveStatus::kEmpty:
-      if (events & (EPOLLHUP | EPOLLRDHUP | EPOLLERR)) {
-        LogMessage(4, "peer error: %s", "Connection invalid");
-        cancel(peer);
-        return;
-      }
       break;  // an empty packet: no property list
     case ReceiveStatus::kOversize:
       length = 0;  // nothing of it was kept
@@ -104,6 +163,7 @@ void PeerConnections::onReadable(Peer& peer, uint32_t events) {
     case ReceiveStatus::kMessage:
       break;
   }
+  peer.lastActivity = NowMicroseconds();
   handleMessage(peer, length);
 }
 
@@ -143,7 +203,11 @@ void PeerConnections::cancel(Peer& peer) {
   const uint64_t id = peer.id;
   mQueue.post([this, id, alive = std::weak_ptr<int>(mLifetime)] {
     if (alive.expired()) return;
-    mPeers.erase(id);
+    const auto found = mPeers.find(id);
+    if (found == mPeers.end()) return;
+    const uint32_t uid = found->second->credentials.uid;
+    mPeers.erase(found);
+    if (--mPeersPerUID[uid] == 0) mPeersPerUID.erase(uid);
     if (mSlotFreed) mSlotFreed();
   });
 }
@@ -237,6 +301,12 @@ void EventListener::onAcceptable() {
   if (!mMonitor.filterBySourceUID(credentials.uid, credentials.gid)) {
     close(fd);
     LogMessage(3, "XPC Event rejected from %d:%d (uid:gid)", uid, gid);
+    return;
+  }
+  if (!mPeers.admits(credentials.uid)) {
+    close(fd);
+    LogMessage(1, "XPC Connection refused from %d:%d (uid:gid): the user holds %lld connections",
+               uid, gid, static_cast<long long>(mMonitor.maxConnectionsPerUID()));
     return;
   }
   mPeers.add(fd, credentials);

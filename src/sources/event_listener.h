@@ -42,6 +42,8 @@ class PeerConnections {
 
   size_t size() const { return mPeers.size(); }
   bool full() const { return mPeers.size() >= kMaxPeerConnections; }
+  // Whether the user may open one more connection (the Monitor's per-user limit).
+  bool admits(uint32_t uid) const;
   // Takes ownership of an admitted connection.
   void add(int fd, const PeerCredentials& credentials);
   // Called whenever a connection has closed.
@@ -52,10 +54,15 @@ class PeerConnections {
   void onReadable(Peer& peer, uint32_t events);
   void handleMessage(Peer& peer, size_t length);
   void cancel(Peer& peer);
+  // Closes the connections idle for the Monitor's timeout and sets the next look at them.
+  void closeIdlePeers();
+  void scheduleIdleCheck();
 
   Monitor& mMonitor;
   EventLoop& mQueue;
   std::map<uint64_t, std::unique_ptr<Peer>> mPeers;
+  std::map<uint32_t, size_t> mPeersPerUID;
+  bool mIdleCheckScheduled = false;
   uint64_t mNextId = 0;
   std::vector<uint8_t> mBuffer;  // one packet; shared, since the queue is serial
   std::function<void()> mSlotFreed;

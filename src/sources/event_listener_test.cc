@@ -8,8 +8,10 @@
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <thread>
 
 #include "platform/event_loop.h"
+#include "platform/testing/log_capture.h"
 #include "sources/monitor.h"
 #include "sources/test_sink.h"
 
@@ -104,6 +106,60 @@ TEST_F(EventSocketTest, MalformedAndOversizePacketsAreDroppedAndTheConnectionSta
   const auto events = mCollector.events();
   ASSERT_EQ(events.size(), 1u);
   EXPECT_EQ(*events[0].findString("eventType"), "after.malformed");
+}
+
+TEST_F(EventSocketTest, EveryPacketSentBeforeTheSenderClosesIsHandled) {
+  ::tarvod::testing::LogCapture capture(4);
+  Monitor& monitor = start();
+  // Not accepted until everything is queued, so the daemon first sees the connection with its
+  // packets and its end at once.
+  monitor.suspend();
+  {
+    Client client(mPath);
+    ASSERT_TRUE(client.send(EventXml("before.empty")));
+    ASSERT_TRUE(client.send(""));
+    ASSERT_TRUE(client.send(EventXml("after.empty")));
+    ASSERT_TRUE(client.send(""));
+  }
+  monitor.resume();
+  ASSERT_TRUE(mCollector.waitFor(2)) << capture.text();
+  settle();
+  const auto events = mCollector.events();
+  ASSERT_EQ(events.size(), 2u);
+  EXPECT_EQ(*events[1].findString("eventType"), "after.empty");
+  const std::string log = capture.text();
+  const std::string malformed = "XPC Malformed event received from " + std::to_string(getuid());
+  const size_t first = log.find(malformed);
+  ASSERT_NE(first, std::string::npos) << log;
+  EXPECT_NE(log.find(malformed, first + 1), std::string::npos) << log;
+  EXPECT_TRUE(::tarvod::testing::LinesInOrder(log, {malformed, "peer error: Connection invalid"}));
+}
+
+TEST_F(EventSocketTest, AConnectionThatSendsNothingIsClosedAfterTheIdleTimeout) {
+  ::tarvod::testing::LogCapture capture(1);
+  mMonitor = std::make_unique<Monitor>(mCollector.hooks());
+  mMonitor->setEventSocketPath(mPath);
+  mMonitor->setConnectionIdleTimeout(1);
+  mMonitor->beginListening();
+  Client idle(mPath);
+  Client busy(mPath);
+  ASSERT_TRUE(busy.send(EventXml("busy.first")));
+  std::this_thread::sleep_for(std::chrono::milliseconds(500));
+  ASSERT_TRUE(busy.send(EventXml("busy.second")));
+  ASSERT_TRUE(mCollector.waitFor(2));
+  // The daemon closes the silent connection about a second after accepting it.
+  const timeval wait{5, 0};
+  setsockopt(idle.fd(), SOL_SOCKET, SO_RCVTIMEO, &wait, sizeof wait);
+  char byte;
+  EXPECT_EQ(recv(idle.fd(), &byte, 1, 0), 0);
+  // The one that sent half a second later is still served.
+  ASSERT_TRUE(busy.send(EventXml("busy.third")));
+  EXPECT_TRUE(mCollector.waitFor(3));
+  EXPECT_NE(
+      capture.text().find("Closing the connection from " + std::to_string(getuid()) + ":" +
+                          std::to_string(getgid()) + " (uid:gid): nothing sent for 1 seconds\n"),
+      std::string::npos)
+      << capture.text();
 }
 
 TEST_F(EventSocketTest, ANonDictionaryMessageClosesTheConnection) {

@@ -53,6 +53,12 @@ struct MonitorHooks {
 inline constexpr size_t kBackPressureHighJobs = 2048;
 inline constexpr size_t kBackPressureLowJobs = 512;
 
+// So that no local user can take every connection to the event socket: a connection that
+// sends nothing for this many seconds is closed, and each user but root may hold this many
+// connections at once.
+inline constexpr int64_t kDefaultConnectionIdleTimeout = 60;
+inline constexpr int64_t kDefaultMaxConnectionsPerUID = 32;
+
 class Monitor {
  public:
   explicit Monitor(MonitorHooks hooks);
@@ -72,6 +78,13 @@ class Monitor {
   // The event socket's path (configuration key eventSocketPath); set before beginListening.
   void setEventSocketPath(std::string path) { mEventSocketPath = std::move(path); }
   const std::string& eventSocketPath() const { return mEventSocketPath; }
+  // Seconds a connection may stay silent before it is closed (connectionIdleTimeout), and
+  // connections one user other than root may hold (maxConnectionsPerUID); 0 or less: no
+  // limit. Set before beginListening.
+  void setConnectionIdleTimeout(int64_t seconds) { mConnectionIdleTimeout = seconds; }
+  int64_t connectionIdleTimeout() const { return mConnectionIdleTimeout; }
+  void setMaxConnectionsPerUID(int64_t count) { mMaxConnectionsPerUID = count; }
+  int64_t maxConnectionsPerUID() const { return mMaxConnectionsPerUID; }
 
   // Starts the event socket listener on queue: 0, or -1 when it cannot be created.
   int SetXPCListenerFor(EventLoop& queue);
@@ -113,6 +126,8 @@ class Monitor {
 
   MonitorHooks mHooks;
   std::string mEventSocketPath;
+  int64_t mConnectionIdleTimeout = kDefaultConnectionIdleTimeout;
+  int64_t mMaxConnectionsPerUID = kDefaultMaxConnectionsPerUID;
   // Accepted connections outlive the listener: stopping it does not cancel them.
   std::unique_ptr<PeerConnections> mPeers;
 };

@@ -36,6 +36,7 @@ TEST(ParseFilterList, ReadsEachPieceAsALeadingInteger) {
       {",", IdSet{0}},
       {"-1", IdSet{-1}},
       {"20,20,+20", IdSet{20}},
+      {"\u00a01000,\u20021001", IdSet{1000, 1001}},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.text.value_or("(absent)"));
