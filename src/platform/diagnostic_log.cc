@@ -99,6 +99,11 @@ void AttachEventLog(int fd) {
   if (old >= 0) close(old);
 }
 
+int DuplicateErrorLog() {
+  std::lock_guard<std::mutex> lock(gErrorLogLock);
+  return gErrorLogFd < 0 ? -1 : fcntl(gErrorLogFd, F_DUPFD_CLOEXEC, 3);
+}
+
 void LogEvent(const plist::Dictionary& event) {
   const int fd = gEventLogFd.load();
   if (fd < 0) return;
