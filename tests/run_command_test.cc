@@ -234,14 +234,15 @@ TEST_F(RunCommandTest, FailuresBeforeAndAfterTheStartEndTheChildWithTheirStatus)
       Command("/bin/echo", {"again"}, {{"stdoutPath", Str(dir.file("append.txt"))}}),
   });
   EXPECT_FALSE(FileExists(touched));
+  // The main thread may write its own lines between the child's and the queue's.
   EXPECT_THAT(log, HasSubstr("DoRunAction (child): Redirect of stdin to " + dir.file("missing") +
-                             " failed errno = 2\nDoRunAction: /usr/bin/touch exited with "
-                             "status 1\n"));
+                             " failed errno = 2\n"));
+  EXPECT_THAT(log, HasSubstr("DoRunAction: /usr/bin/touch exited with status 1\n"));
   EXPECT_THAT(log, HasSubstr("DoRunAction: User '" + sUser + "-none' not found. Aborting action"));
   EXPECT_THAT(log,
               HasSubstr("DoRunAction: Group '" + sGroup + "-none' not found. Aborting action"));
-  EXPECT_THAT(log, HasSubstr("DoRunAction (child): chdir to " + dir.file("nowhere") +
-                             " failed\nDoRunAction: /usr/bin/touch exited with status 2\n"));
+  EXPECT_THAT(log, HasSubstr("DoRunAction (child): chdir to " + dir.file("nowhere") + " failed\n"));
+  EXPECT_THAT(log, HasSubstr("DoRunAction: /usr/bin/touch exited with status 2\n"));
   EXPECT_THAT(log, HasSubstr("DoRunAction: " + dir.file("no-program") + " exited with status 2"));
   // Earlier content stays; each run's output follows whole.
   EXPECT_EQ(ReadFile(dir.file("append.txt")), std::string(100, 'o') + "new\nagain\n");
@@ -253,10 +254,9 @@ TEST_F(RunCommandTest, AFailedIdentityChangeEndsTheChildBeforeTheProgram) {
   const std::string log = runToEnd({Command("/usr/bin/touch", {touched})}, {},
                                    {"/usr/bin/unshare", "--user", "--map-root-user"});
   EXPECT_FALSE(FileExists(touched));
-  EXPECT_THAT(log, ::testing::MatchesRegex(
-                       "(.|\n)*DoRunAction \\(child\\): Change to user ID 99, group ID 99 "
-                       "failed errno = [0-9]+\nDoRunAction: /usr/bin/touch exited with status "
-                       "1\n(.|\n)*"));
+  EXPECT_THAT(log, HasSubstr("DoRunAction (child): Change to user ID 99, group ID 99 failed "
+                             "errno = 1\n"));
+  EXPECT_THAT(log, HasSubstr("DoRunAction: /usr/bin/touch exited with status 1\n"));
 }
 
 TEST_F(RunCommandTest, ATimeLimitEndsTheProgramAndEverythingItStarted) {
@@ -270,8 +270,8 @@ TEST_F(RunCommandTest, ATimeLimitEndsTheProgramAndEverythingItStarted) {
   const auto elapsed = std::chrono::steady_clock::now() - before;
   EXPECT_LT(elapsed, 20s);
   EXPECT_THAT(log, HasSubstr("DoRunAction: /bin/sleep still running after 0.5 seconds; ending its"
-                             " process group (SIGTERM, SIGKILL 2 seconds later)\n"
-                             "DoRunAction: /bin/sleep exited with status 143\n"));
+                             " process group (SIGTERM, SIGKILL 2 seconds later)\n"));
+  EXPECT_THAT(log, HasSubstr("DoRunAction: /bin/sleep exited with status 143\n"));
   EXPECT_THAT(log, HasSubstr("DoRunAction: /bin/sh still running after 1 seconds"));
   EXPECT_THAT(log, HasSubstr("DoRunAction: /bin/sh exited with status 137\n"));
   for (const char* file : {"sh.pid", "sleep.pid"}) {

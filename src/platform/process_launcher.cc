@@ -9,6 +9,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cmath>
@@ -206,7 +207,9 @@ bool AwaitEnd(const ChildProcess& child, double seconds) {
   const auto deadline = Clock::now() + std::chrono::duration<double>(seconds);
   for (;;) {
     const std::chrono::duration<double, std::milli> left = deadline - Clock::now();
-    const int milliseconds = left.count() <= 0 ? 0 : static_cast<int>(std::ceil(left.count()));
+    // Long limits are waited for an hour at a time: poll takes an int of milliseconds.
+    const int milliseconds =
+        left.count() <= 0 ? 0 : static_cast<int>(std::ceil(std::min(left.count(), 3.6e6)));
     struct pollfd entry {
       child.pidfd, POLLIN, 0
     };
