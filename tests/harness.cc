@@ -183,10 +183,12 @@ RunResult RunProgram(const std::vector<std::string>& argv, std::string_view stdi
   return result;
 }
 
-Daemon::Daemon(const std::vector<std::string>& args, const TempDir& dir) {
+Daemon::Daemon(const std::vector<std::string>& args, const TempDir& dir,
+               const std::vector<std::string>& launcher) {
   mStderrPath = dir.file("daemon.stderr");
   const std::string stdoutPath = dir.file("daemon.stdout");
-  std::vector<std::string> full{TarvodBinary()};
+  std::vector<std::string> full = launcher;
+  full.push_back(TarvodBinary());
   full.insert(full.end(), args.begin(), args.end());
   mPid = fork();
   if (mPid == 0) {

@@ -61,7 +61,10 @@ RunResult RunProgram(const std::vector<std::string>& argv, std::string_view stdi
 class Daemon {
  public:
   // Starts the binary with args (argv[0] is added); stdout and stderr go to files in dir.
-  Daemon(const std::vector<std::string>& args, const TempDir& dir);
+  // A launcher (for example {"unshare", "--user", "--map-root-user"}) runs the binary in
+  // its place, with the same process ID.
+  Daemon(const std::vector<std::string>& args, const TempDir& dir,
+         const std::vector<std::string>& launcher = {});
   ~Daemon();
   Daemon(const Daemon&) = delete;
   Daemon& operator=(const Daemon&) = delete;

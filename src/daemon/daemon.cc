@@ -9,6 +9,7 @@
 #include "daemon/options.h"
 #include "daemon/signals.h"
 #include "daemon/state.h"
+#include "engine/rule_processor.h"
 #include "platform/diagnostic_log.h"
 #include "platform/host_stats.h"
 #include "platform/main_loop.h"
@@ -89,6 +90,8 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   LogMessage(4, "Velkin rules path is %s", mRulesPath.c_str());
   mConfiguration.set("rulesPath", plist::Value(mRulesPath));
   BuildLevelNameTable();
+  SetDefaultCommandTimeout(static_cast<double>(
+      std::max<int64_t>(0, ConfigurationInteger(mConfiguration, "commandTimeout"))));
   InitHostStats();
   ConfigureStructuredLog(ConfigurationString(mConfiguration, "structuredLogPath", ""));
   if (!DefaultStructuredLog().canDeliver()) {

@@ -4,6 +4,7 @@
 
 #include "actions/debug_dump.h"
 #include "actions/log_action.h"
+#include "actions/run_command_action.h"
 #include "engine/keyword_tables.h"
 #include "engine/rule_processor.h"
 #include "platform/diagnostic_log.h"
@@ -33,15 +34,22 @@ std::string LowerCase(std::string text) {
   return text;
 }
 
+RunCommandAction& RunCommandHandler() {
+  static RunCommandAction runCommand(ProcessLauncher::Real());
+  return runCommand;
+}
+
 // The handler of an action code; nullptr for the keywords that do nothing in this build
-// (the mail, notification and command handlers come later, and sendmessage, sendqe, addtodb
-// and publishrss have none).
+// (the mail and notification handlers come later, and sendmessage, sendqe, addtodb and
+// publishrss have none).
 Action* HandlerFor(long code) {
   static LogAction log;
   static DebugDumpAction debugDump;
   switch (code) {
     case kLog:
       return &log;
+    case kRunCommand:
+      return &RunCommandHandler();
     case kDebugDump:
       return &debugDump;
     default:
@@ -50,6 +58,8 @@ Action* HandlerFor(long code) {
 }
 
 }  // namespace
+
+void SetDefaultCommandTimeout(double seconds) { RunCommandHandler().setDefaultTimeout(seconds); }
 
 void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Context& context) {
   const plist::Value* type = action.find("type");

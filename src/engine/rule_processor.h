@@ -14,6 +14,8 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
 bool IsUserInGroup(const std::string& user, const std::string& group);
 // Runs one action entry of a fired rule.
 void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Context& context);
+// The time limit in seconds of run-command actions without their own; 0: none.
+void SetDefaultCommandTimeout(double seconds);
 // True when the rule fired.
 bool ProcessRule(const Rule& rule, Context& context);
 

@@ -228,6 +228,12 @@ void AttachEventLog(int fd) {
   if (old >= 0) close(old);
 }
 
+int DuplicateErrorLog() {
+  ErrorLog& log = gErrorLog;
+  std::lock_guard<std::mutex> lock(log.mLock);
+  return log.mFd < 0 ? -1 : fcntl(log.mFd, F_DUPFD_CLOEXEC, 3);
+}
+
 void LogEvent(const plist::Dictionary& event) {
   const int fd = gEventLogFd.load();
   if (fd < 0) return;

@@ -52,6 +52,10 @@ int SafeOpen(const char* path, mode_t mode, int flags);
 // Take ownership of an open, appending descriptor as the error log / event log.
 void AttachErrorLog(int fd);
 void AttachEventLog(int fd);
+// A close-on-exec duplicate (numbered 3 or above) of the error log's descriptor, for a child
+// process that writes its own lines before it executes a program; -1 while no error log is
+// attached. The caller closes it.
+int DuplicateErrorLog();
 // Appends the event's text form and one newline to the event log, when one is attached.
 void LogEvent(const plist::Dictionary& event);
 // Syncs and closes both logs; afterwards LogMessage and LogEvent write nothing.

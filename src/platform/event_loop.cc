@@ -17,8 +17,11 @@ int OnIo(sd_event_source*, int, uint32_t revents, void* userdata) {
   return 0;
 }
 
-int OnTimer(sd_event_source*, uint64_t, void* userdata) {
+int OnTimer(sd_event_source* source, uint64_t, void* userdata) {
   (*static_cast<std::function<void()>*>(userdata))();
+  // A fired one-shot is freed now (its job with it), not kept by the loop until it ends:
+  // dropping the loop's reference leaves only the one the dispatch holds until it returns.
+  sd_event_source_set_floating(source, 0);
   return 0;
 }
 
