@@ -216,7 +216,8 @@ bool IsPowerOfTwoUpTo8(uint64_t n) { return n == 1 || n == 2 || n == 4 || n == 8
 // header and the offset table with all its bytes, references name existing objects, no object
 // contains itself, containers nest at most kMaxNestingDepth deep, and the tree that libplist
 // builds (a shared object is copied at every reference) stays within a budget proportional to
-// the input. Integers must fit in 64 bits and UTF-16 strings must pair their surrogates.
+// the input, both in nodes and in the bytes of the strings, keys and data it copies. Integers
+// must fit in 64 bits and UTF-16 strings must pair their surrogates.
 class BinaryChecker {
  public:
   explicit BinaryChecker(std::string_view bytes)
@@ -243,10 +244,17 @@ class BinaryChecker {
     // least one byte, so one node per input byte admits every such file; a shared container
     // copied at each of its references cannot multiply the tree beyond that.
     mBudget = static_cast<uint64_t>(mSize) + 1024;
+    // A node is cheap to count but a shared string or data object is copied whole at every
+    // reference: one reference byte can stand for kilobytes, so payload bytes have their own
+    // budget.
+    mByteBudget = MaxExpandedBytes(mSize);
     static_assert(kMaxFileSize + 1024 < (uint64_t{1} << 32), "expanded sizes are kept in 32 bits");
+    static_assert(kMaxExpansionFactor * kMaxFileSize + kExpansionAllowance < (uint64_t{1} << 32),
+                  "expanded byte sizes are kept in 32 bits");
     mState.assign(count, kUnvisited);
     mHeight.assign(count, 0);
     mExpanded.assign(count, 0);
+    mExpandedBytes.assign(count, 0);
     return walk(top);
   }
 
@@ -265,6 +273,7 @@ class BinaryChecker {
     uint64_t refs;  // references the container holds
     uint64_t next;  // the next of them to visit
     uint64_t expanded;
+    uint64_t bytes;  // payload bytes of the expanded subtree
     uint32_t height;
   };
 
@@ -360,10 +369,25 @@ class BinaryChecker {
 
   static bool IsContainer(uint8_t type) { return type == 0xA || type == 0xD; }
 
-  // Adds a finished child to its parent; false when the budget or depth is exceeded.
-  bool addChild(Frame& parent, uint64_t expanded, uint32_t height) {
+  // The bytes libplist and the conversion copy for one reference to a leaf: the data, or the
+  // string's text (a UTF-16 unit becomes at most three bytes of UTF-8).
+  static uint64_t PayloadBytes(const Object& object) {
+    switch (object.type) {
+      case 0x4:
+      case 0x5:
+        return object.count;
+      case 0x6:
+        return 3 * object.count;
+      default:
+        return 0;
+    }
+  }
+
+  // Adds a finished child to its parent; false when a budget or the depth is exceeded.
+  bool addChild(Frame& parent, uint64_t expanded, uint64_t bytes, uint32_t height) {
     parent.expanded += expanded;
-    if (parent.expanded > mBudget) return false;
+    parent.bytes += bytes;
+    if (parent.expanded > mBudget || parent.bytes > mByteBudget) return false;
     if (height + 1 > parent.height) parent.height = height + 1;
     return true;
   }
@@ -372,11 +396,11 @@ class BinaryChecker {
     std::vector<Frame> stack;
     Object object;
     if (!readObject(top, object)) return false;
-    if (!IsContainer(object.type)) return true;
+    if (!IsContainer(object.type)) return PayloadBytes(object) <= mByteBudget;
     const auto push = [&](uint64_t index, const Object& o) {
       mState[index] = kOnPath;
       const uint64_t refs = o.type == 0xD ? 2 * o.count : o.count;
-      stack.push_back(Frame{index, o, refs, 0, 1, 1});
+      stack.push_back(Frame{index, o, refs, 0, 1, 0, 1});
     };
     push(top, object);
     while (!stack.empty()) {
@@ -386,8 +410,11 @@ class BinaryChecker {
         stack.pop_back();
         mState[done.index] = kDone;
         mExpanded[done.index] = static_cast<uint32_t>(done.expanded);
+        mExpandedBytes[done.index] = static_cast<uint32_t>(done.bytes);
         mHeight[done.index] = static_cast<uint16_t>(done.height);
-        if (!stack.empty() && !addChild(stack.back(), done.expanded, done.height)) return false;
+        if (!stack.empty() && !addChild(stack.back(), done.expanded, done.bytes, done.height)) {
+          return false;
+        }
         continue;
       }
       const uint64_t k = frame.next++;
@@ -399,7 +426,9 @@ class BinaryChecker {
         if (isKey && !isStringObject(child)) return false;
         // A shared container nests as deep below this reference as below its first one.
         if (stack.size() + mHeight[child] > static_cast<size_t>(kMaxNestingDepth)) return false;
-        if (!addChild(frame, mExpanded[child], mHeight[child])) return false;
+        if (!addChild(frame, mExpanded[child], mExpandedBytes[child], mHeight[child])) {
+          return false;
+        }
         continue;
       }
       if (!readObject(child, object)) return false;
@@ -411,8 +440,9 @@ class BinaryChecker {
       }
       mState[child] = kDone;
       mExpanded[child] = 1;
+      mExpandedBytes[child] = static_cast<uint32_t>(PayloadBytes(object));
       mHeight[child] = 0;
-      if (!addChild(frame, 1, 0)) return false;
+      if (!addChild(frame, 1, mExpandedBytes[child], 0)) return false;
     }
     return true;
   }
@@ -430,11 +460,13 @@ class BinaryChecker {
   const uint8_t* mTable = nullptr;
   uint64_t mCount = 0;
   uint64_t mBudget = 0;
+  uint64_t mByteBudget = 0;
   std::vector<State> mState;
   // Per declared object, so kept narrow: heights are at most kMaxNestingDepth and expanded
-  // sizes at most the budget, which is below 2^32 for any input within kMaxFileSize.
+  // sizes at most their budgets, which are below 2^32 for any input within kMaxFileSize.
   std::vector<uint16_t> mHeight;
   std::vector<uint32_t> mExpanded;
+  std::vector<uint32_t> mExpandedBytes;
 };
 
 // ---------------------------------------------------------------------------------------------
