@@ -167,6 +167,10 @@ TEST(PropertyListBinary, ReadsFractionalDatesWideIntegersAndUids) {
   // Past the 64-bit range: refused rather than wrapped.
   EXPECT_FALSE(
       ReadPropertyList(BinaryList({"\x14" + std::string(8, '\0') + std::string(8, '\xFF')})));
+  // Dates outside years 1 to 9999, which no other form holds, are refused: 1e12 and NaN.
+  EXPECT_FALSE(ReadPropertyList(BinaryList({"\x33\x42\x6D\x1A\x94\xA2\x00\x00\x00"s})));
+  EXPECT_FALSE(ReadPropertyList(BinaryList({"\x33\x7F\xF8\x00\x00\x00\x00\x00\x00"s})));
+  EXPECT_EQ(ReadPropertyList(BinaryList({"\x60"s})), Value(""));
 }
 
 TEST(PropertyListText, RoundTripsEveryKindThroughDescribe) {
