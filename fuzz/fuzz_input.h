@@ -28,7 +28,8 @@ class ByteReader {
   }
   // A length byte, then that many bytes (fewer at the end of the input).
   std::string text() {
-    const size_t taken = std::min<size_t>(byte(), mSize - mPos);
+    const size_t length = byte();  // before the rest is measured
+    const size_t taken = std::min(length, mSize - mPos);
     std::string out(reinterpret_cast<const char*>(mData + mPos), taken);
     mPos += taken;
     return out;
