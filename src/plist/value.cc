@@ -266,7 +266,9 @@ std::vector<std::string> Dictionary::sortedKeys() const {
 }
 
 std::string FormatDate(Date date, bool localTime) {
-  double seconds = std::floor(date.secondsSince2001 + kUnixTimeOfReferenceDate);
+  // Whole seconds since 2001 first, as the XML writer takes them: the shift to 1970 would
+  // round away a fraction too small for its magnitude (-1e-9 would show as 00:00:00).
+  double seconds = std::floor(date.secondsSince2001) + kUnixTimeOfReferenceDate;
   if (!std::isfinite(seconds) || seconds > 253402300799.0 || seconds < -62135596800.0) {
     seconds = kUnixTimeOfReferenceDate;  // outside years 1 to 9999: show the reference date
   }
