@@ -59,6 +59,26 @@ run: build
 	@mkdir -p run
 	./build/src/daemon/tarvod -c examples/tarvod.plist -r examples/rules
 
+# Fuzzing (fuzz/): each target built with clang, libFuzzer, ASan and UBSan in build-fuzz, then
+# run for FUZZ_SECONDS over its committed seeds; inputs it finds go to build-fuzz/corpus/TARGET,
+# crashes to build-fuzz/artifacts/. fuzz/TARGET.flags adds libFuzzer options for one target.
+FUZZ_SECONDS ?= 60
+FUZZ_TARGETS := plist_xml plist_binary plist_text context criteria bsm_record event_packet
+FUZZ_PACKAGES := clang libclang-rt-14-dev
+.PHONY: fuzz
+fuzz: deps
+	@$(MAKE) --no-print-directory deps PACKAGES="$(FUZZ_PACKAGES)"
+	CC=clang CXX=clang++ cmake -S . -B build-fuzz -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+	  -DTARVOD_FUZZ=ON -DTARVOD_BENCH=OFF >/dev/null
+	ninja -C build-fuzz -j $(JOBS) $(FUZZ_TARGETS:%=%_fuzz)
+	@mkdir -p build-fuzz/artifacts
+	@for t in $(FUZZ_TARGETS); do \
+	  echo "fuzzing $$t for $(FUZZ_SECONDS) s"; mkdir -p build-fuzz/corpus/$$t; \
+	  ./build-fuzz/fuzz/$${t}_fuzz -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
+	    -artifact_prefix=build-fuzz/artifacts/$$t- $$(cat fuzz/$$t.flags 2>/dev/null) \
+	    build-fuzz/corpus/$$t fuzz/corpus/$$t || exit 1; \
+	done
+
 format:
 	git ls-files '*.cc' '*.h' | xargs clang-format -i
 

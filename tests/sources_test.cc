@@ -4,12 +4,14 @@
 #include <grp.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <plist/plist.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
+#include <chrono>
 #include <filesystem>
 
 #include "harness.h"
@@ -223,6 +225,92 @@ TEST_F(SourcesTest, MessagesOnOneConnectionAreHandledInOrderAndSurviveMalformedO
   ASSERT_NE(converted, std::string::npos);
   EXPECT_NE(text.find("XPC Malformed event received from 0:0 (uid:gid)\n", converted),
             std::string::npos);
+  close(connection.fd);
+}
+
+std::string BigEndian(uint64_t value, size_t size) {
+  std::string out(size, '\0');
+  for (size_t i = 0; i < size; ++i) out[size - 1 - i] = static_cast<char>(value >> (8 * i));
+  return out;
+}
+
+// A binary property list whose top object is a container holding `references` two-byte
+// references to object 1, a string (0x5) or data (0x4) object of `length` bytes. A dictionary
+// of n entries is 2n references, so the payload is then every key as well as every value.
+std::string SharedPayloadList(char container, char payloadType, size_t references, size_t length) {
+  const size_t count = container == 'd' ? references / 2 : references;
+  std::string out = "bplist00";
+  const uint64_t top = out.size();
+  out += std::string(1, container == 'd' ? '\xDF' : '\xAF') + "\x11" + BigEndian(count, 2);
+  for (size_t i = 0; i < references; ++i) out += BigEndian(1, 2);
+  const uint64_t payload = out.size();
+  out += std::string(1, static_cast<char>(payloadType << 4 | 0x0F)) + "\x12" +
+         BigEndian(length, 4) + std::string(length, 'p');
+  const uint64_t table = out.size();
+  out += BigEndian(top, 4) + BigEndian(payload, 4);
+  return out + std::string(6, '\0') + "\x04\x02" + BigEndian(2, 8) + BigEndian(0, 8) +
+         BigEndian(table, 8);
+}
+
+// An event as a real writer encodes it: libplist's binary writer stores each distinct string
+// once, so its 3,000 records share a handful of short strings.
+std::string SharedShortStringsEvent() {
+  plist_t details = plist_new_dict();
+  plist_t records = plist_new_array();
+  for (int i = 0; i < 3000; ++i) {
+    plist_t record = plist_new_dict();
+    plist_dict_set_item(record, "path", plist_new_string(i % 2 ? "/usr/bin/ssh" : "/bin/sh"));
+    plist_dict_set_item(record, "user", plist_new_string("root"));
+    plist_dict_set_item(record, "result", plist_new_string("allowed"));
+    plist_array_append_item(records, record);
+  }
+  plist_dict_set_item(details, "tag", plist_new_string("shared"));
+  plist_dict_set_item(details, "records", records);
+  plist_t event = plist_new_dict();
+  plist_dict_set_item(event, "eventType", plist_new_string("t"));
+  plist_dict_set_item(event, "eventDetails", details);
+  char* bytes = nullptr;
+  uint32_t length = 0;
+  plist_to_bin(event, &bytes, &length);
+  std::string out(bytes, length);
+  plist_to_bin_free(bytes);
+  plist_free(event);
+  return out;
+}
+
+TEST_F(SourcesTest, SharedPayloadsCannotExhaustTheDaemonsMemory) {
+  startDaemon();
+  const SocketResult connection = ConnectSeqpacket(mSocketPath);
+  ASSERT_GE(connection.fd, 0) << connection.error;
+  const long before = PeakResidentKb(mDaemon->pid());
+  ASSERT_GT(before, 0);
+  // Each would expand to 1 to 4 GB: 32,000 references to one 32,000-byte payload in an
+  // array, 64,000 to one of 64,000 bytes in a dictionary.
+  const std::string hostile[] = {
+      SharedPayloadList('a', 0x5, 32000, 32000),
+      SharedPayloadList('a', 0x4, 32000, 32000),
+      SharedPayloadList('d', 0x5, 64000, 64000),
+      SharedPayloadList('d', 0x4, 64000, 64000),
+  };
+  const auto start = std::chrono::steady_clock::now();
+  std::string error;
+  for (const std::string& bytes : hostile) {
+    ASSERT_TRUE(SendPacket(connection.fd, bytes, &error)) << error;
+  }
+  const std::string legitimate = SharedShortStringsEvent();
+  ASSERT_TRUE(SendPacket(connection.fd, legitimate, &error)) << error;
+  ASSERT_TRUE(waitForEvent("shared 0 0\n")) << log();
+  const auto elapsed = std::chrono::steady_clock::now() - start;
+  EXPECT_LT(elapsed, 5s);
+  const std::string text = log();
+  size_t malformed = 0;
+  for (size_t at = text.find("XPC Malformed event received from 0:0 (uid:gid)");
+       at != std::string::npos; at = text.find("XPC Malformed event", at + 1)) {
+    ++malformed;
+  }
+  EXPECT_EQ(malformed, std::size(hostile));
+  const long growthKb = PeakResidentKb(mDaemon->pid()) - before;
+  EXPECT_LT(growthKb, 32 * 1024) << "peak grew by " << growthKb << " kB";
   close(connection.fd);
 }
 

@@ -1,7 +1,8 @@
-// XML and binary property lists through libplist, behind checks of our own. libplist 2.2 is
-// not built for hostile input: before it sees any bytes, the XML's nesting and scalar texts and
-// the binary's whole object graph (bounds, cycles, depth, expanded size) are checked here, and
-// its tree is converted with a depth limit and UTF-8 validation of every string and key.
+// XML property lists through libplist, behind checks of our own; binary ones read here. libplist
+// 2.2 is not built for hostile input: before it sees any bytes, the XML's nesting and scalar
+// texts are checked here, and its tree is converted with a depth limit and UTF-8 validation of
+// every string and key. A binary list's whole object graph (bounds, cycles, depth, expanded
+// size) is checked before its value is built straight from the bytes.
 #include "plist/codec.h"
 
 #include <fcntl.h>
@@ -202,6 +203,9 @@ bool XmlShapeIsSafe(std::string_view xml) {
 
 constexpr std::string_view kBinaryMagic = "bplist00";
 constexpr size_t kTrailerSize = 32;
+// 0001-01-01 00:00:00 and 10000-01-01 00:00:00 UTC in seconds since 2001.
+constexpr double kFirstDateSeconds = -63113904000.0;
+constexpr double kPastLastDateSeconds = 252423993600.0;
 
 uint64_t ReadBigEndian(const uint8_t* p, size_t size) {
   uint64_t value = 0;
@@ -211,16 +215,26 @@ uint64_t ReadBigEndian(const uint8_t* p, size_t size) {
 
 bool IsPowerOfTwoUpTo8(uint64_t n) { return n == 1 || n == 2 || n == 4 || n == 8; }
 
-// Checks the object graph of a binary list the way libplist will walk it, without recursion:
+// Checks the object graph of a binary list the way the reader will walk it, without recursion:
 // the trailer and offset table lie inside the data, every reachable object lies between the
 // header and the offset table with all its bytes, references name existing objects, no object
-// contains itself, containers nest at most kMaxNestingDepth deep, and the tree that libplist
-// builds (a shared object is copied at every reference) stays within a budget proportional to
-// the input. Integers must fit in 64 bits and UTF-16 strings must pair their surrogates.
+// contains itself, containers nest at most kMaxNestingDepth deep, and the value built from it
+// (a shared object is copied at every reference) stays within a budget proportional to the
+// input, both in nodes and in the bytes of the strings, keys and data it copies. Integers
+// must fit in 64 bits and UTF-16 strings must pair their surrogates.
 class BinaryChecker {
  public:
   explicit BinaryChecker(std::string_view bytes)
       : mData(reinterpret_cast<const uint8_t*>(bytes.data())), mSize(bytes.size()) {}
+
+  // The list's value once check() has passed; the check's bookkeeping is freed first.
+  std::optional<Value> read() {
+    mState = {};
+    mHeight = {};
+    mExpanded = {};
+    mExpandedBytes = {};
+    return valueOf(mTop, 0);
+  }
 
   bool check() {
     if (mSize < kBinaryMagic.size() + 1 + kTrailerSize) return false;
@@ -239,14 +253,22 @@ class BinaryChecker {
     mObjectsEnd = tableOffset;
     mTable = mData + tableOffset;
     mCount = count;
+    mTop = top;
     // Without shared containers every expanded node but the top one is a reference of at
     // least one byte, so one node per input byte admits every such file; a shared container
     // copied at each of its references cannot multiply the tree beyond that.
     mBudget = static_cast<uint64_t>(mSize) + 1024;
+    // A node is cheap to count but a shared string or data object is copied whole at every
+    // reference: one reference byte can stand for kilobytes, so payload bytes have their own
+    // budget.
+    mByteBudget = MaxExpandedBytes(mSize);
     static_assert(kMaxFileSize + 1024 < (uint64_t{1} << 32), "expanded sizes are kept in 32 bits");
+    static_assert(kMaxExpansionFactor * kMaxFileSize + kExpansionAllowance < (uint64_t{1} << 32),
+                  "expanded byte sizes are kept in 32 bits");
     mState.assign(count, kUnvisited);
     mHeight.assign(count, 0);
     mExpanded.assign(count, 0);
+    mExpandedBytes.assign(count, 0);
     return walk(top);
   }
 
@@ -255,6 +277,7 @@ class BinaryChecker {
 
   struct Object {
     uint8_t type = 0;      // high nibble of the marker
+    uint8_t low = 0;       // low nibble of the marker
     uint64_t count = 0;    // elements, characters or bytes
     uint64_t payload = 0;  // offset of the first byte after marker and count
   };
@@ -265,6 +288,7 @@ class BinaryChecker {
     uint64_t refs;  // references the container holds
     uint64_t next;  // the next of them to visit
     uint64_t expanded;
+    uint64_t bytes;  // payload bytes of the expanded subtree
     uint32_t height;
   };
 
@@ -275,6 +299,7 @@ class BinaryChecker {
     const uint8_t marker = mData[offset];
     out.type = marker >> 4;
     const uint8_t low = marker & 0x0F;
+    out.low = low;
     uint64_t pos = offset + 1;
     const auto available = [&](uint64_t bytes) { return bytes <= mObjectsEnd - pos; };
     switch (out.type) {
@@ -330,7 +355,7 @@ class BinaryChecker {
         out.count = count;
         out.payload = pos;
         if (out.type == 0x6) return utf16IsPaired(pos, count);
-        // libplist cuts a string at its first NUL: refuse rather than shorten it silently.
+        // No NUL: XML could not hold the string, and libplist would cut it there.
         if (out.type == 0x5) return std::memchr(mData + pos, 0, count) == nullptr;
         return true;
       }
@@ -360,10 +385,25 @@ class BinaryChecker {
 
   static bool IsContainer(uint8_t type) { return type == 0xA || type == 0xD; }
 
-  // Adds a finished child to its parent; false when the budget or depth is exceeded.
-  bool addChild(Frame& parent, uint64_t expanded, uint32_t height) {
+  // The bytes one reference to a leaf copies into the value: the data, or the string's text (a
+  // UTF-16 unit becomes at most three bytes of UTF-8).
+  static uint64_t PayloadBytes(const Object& object) {
+    switch (object.type) {
+      case 0x4:
+      case 0x5:
+        return object.count;
+      case 0x6:
+        return 3 * object.count;
+      default:
+        return 0;
+    }
+  }
+
+  // Adds a finished child to its parent; false when a budget or the depth is exceeded.
+  bool addChild(Frame& parent, uint64_t expanded, uint64_t bytes, uint32_t height) {
     parent.expanded += expanded;
-    if (parent.expanded > mBudget) return false;
+    parent.bytes += bytes;
+    if (parent.expanded > mBudget || parent.bytes > mByteBudget) return false;
     if (height + 1 > parent.height) parent.height = height + 1;
     return true;
   }
@@ -372,11 +412,11 @@ class BinaryChecker {
     std::vector<Frame> stack;
     Object object;
     if (!readObject(top, object)) return false;
-    if (!IsContainer(object.type)) return true;
+    if (!IsContainer(object.type)) return PayloadBytes(object) <= mByteBudget;
     const auto push = [&](uint64_t index, const Object& o) {
       mState[index] = kOnPath;
       const uint64_t refs = o.type == 0xD ? 2 * o.count : o.count;
-      stack.push_back(Frame{index, o, refs, 0, 1, 1});
+      stack.push_back(Frame{index, o, refs, 0, 1, 0, 1});
     };
     push(top, object);
     while (!stack.empty()) {
@@ -386,8 +426,11 @@ class BinaryChecker {
         stack.pop_back();
         mState[done.index] = kDone;
         mExpanded[done.index] = static_cast<uint32_t>(done.expanded);
+        mExpandedBytes[done.index] = static_cast<uint32_t>(done.bytes);
         mHeight[done.index] = static_cast<uint16_t>(done.height);
-        if (!stack.empty() && !addChild(stack.back(), done.expanded, done.height)) return false;
+        if (!stack.empty() && !addChild(stack.back(), done.expanded, done.bytes, done.height)) {
+          return false;
+        }
         continue;
       }
       const uint64_t k = frame.next++;
@@ -399,7 +442,9 @@ class BinaryChecker {
         if (isKey && !isStringObject(child)) return false;
         // A shared container nests as deep below this reference as below its first one.
         if (stack.size() + mHeight[child] > static_cast<size_t>(kMaxNestingDepth)) return false;
-        if (!addChild(frame, mExpanded[child], mHeight[child])) return false;
+        if (!addChild(frame, mExpanded[child], mExpandedBytes[child], mHeight[child])) {
+          return false;
+        }
         continue;
       }
       if (!readObject(child, object)) return false;
@@ -411,10 +456,131 @@ class BinaryChecker {
       }
       mState[child] = kDone;
       mExpanded[child] = 1;
+      mExpandedBytes[child] = static_cast<uint32_t>(PayloadBytes(object));
       mHeight[child] = 0;
-      if (!addChild(frame, 1, 0)) return false;
+      if (!addChild(frame, 1, mExpandedBytes[child], 0)) return false;
     }
     return true;
+  }
+
+  static void AppendUtf8(std::string& out, uint32_t c) {
+    if (c < 0x80) {
+      out += static_cast<char>(c);
+    } else if (c < 0x800) {
+      out += static_cast<char>(0xC0 | c >> 6);
+      out += static_cast<char>(0x80 | (c & 0x3F));
+    } else if (c < 0x10000) {
+      out += static_cast<char>(0xE0 | c >> 12);
+      out += static_cast<char>(0x80 | (c >> 6 & 0x3F));
+      out += static_cast<char>(0x80 | (c & 0x3F));
+    } else {
+      out += static_cast<char>(0xF0 | c >> 18);
+      out += static_cast<char>(0x80 | (c >> 12 & 0x3F));
+      out += static_cast<char>(0x80 | (c >> 6 & 0x3F));
+      out += static_cast<char>(0x80 | (c & 0x3F));
+    }
+  }
+
+  // The text of a checked string object; nullopt when it is not UTF-8.
+  std::optional<std::string> textOf(const Object& o) const {
+    const uint8_t* p = mData + o.payload;
+    std::string text;
+    if (o.type == 0x5) {
+      text.assign(reinterpret_cast<const char*>(p), o.count);
+      if (!IsValidUtf8(text)) return std::nullopt;
+      return text;
+    }
+    text.reserve(o.count);
+    for (uint64_t i = 0; i < o.count; ++i) {
+      uint32_t c = static_cast<uint32_t>(ReadBigEndian(p + 2 * i, 2));
+      if (c >= 0xD800 && c <= 0xDBFF) {  // paired, as the check made sure
+        const uint32_t next = static_cast<uint32_t>(ReadBigEndian(p + 2 * ++i, 2));
+        c = 0x10000 + ((c - 0xD800) << 10) + (next - 0xDC00);
+      }
+      AppendUtf8(text, c);
+    }
+    return text;
+  }
+
+  // The value of an object of a checked list, read straight from the bytes: going through
+  // libplist's tree would cost another hundred bytes or more per node on top of the value's.
+  // depth: the containers around it; the check bounds it already.
+  std::optional<Value> valueOf(uint64_t index, int depth) const {
+    Object o;
+    if (!readObject(index, o)) return std::nullopt;
+    const uint8_t* p = mData + o.payload;
+    switch (o.type) {
+      case 0x0:
+        return Value::Boolean(o.low == 0x9);
+      case 0x1: {
+        // Stored as the 64-bit pattern: 8 and 16 bytes read as signed, fewer as unsigned. The
+        // high half of 16 bytes is the sign extension of the low half.
+        const uint64_t bits = o.count == 16 ? ReadBigEndian(p + 8, 8) : ReadBigEndian(p, o.count);
+        return Value::Integer(static_cast<int64_t>(bits));
+      }
+      case 0x2: {
+        if (o.low == 2) {
+          const uint32_t bits = static_cast<uint32_t>(ReadBigEndian(p, 4));
+          float f;
+          std::memcpy(&f, &bits, sizeof f);
+          return Value::Real(f);
+        }
+        const uint64_t bits = ReadBigEndian(p, 8);
+        double d;
+        std::memcpy(&d, &bits, sizeof d);
+        return Value::Real(d);
+      }
+      case 0x3: {
+        const uint64_t bits = ReadBigEndian(p, 8);
+        double seconds;
+        std::memcpy(&seconds, &bits, sizeof seconds);
+        // Years 1 to 9999, the dates every other form can hold.
+        if (!(seconds >= kFirstDateSeconds && seconds < kPastLastDateSeconds)) return std::nullopt;
+        return Value::FromDate(Date{seconds});
+      }
+      case 0x4:
+        return Value::FromData(Data(p, p + o.count));
+      case 0x5:
+      case 0x6: {
+        std::optional<std::string> text = textOf(o);
+        if (!text) return std::nullopt;
+        return Value(std::move(*text));
+      }
+      case 0x8:
+        // A keyed-archive reference; written in XML as this very dictionary.
+        return Value(Dictionary{
+            {"CF$UID", Value::Integer(static_cast<int64_t>(ReadBigEndian(p, o.count)))}});
+      case 0xA: {
+        if (depth >= kMaxNestingDepth) return std::nullopt;
+        Array array;
+        array.reserve(o.count);
+        for (uint64_t k = 0; k < o.count; ++k) {
+          std::optional<Value> item = valueOf(ReadBigEndian(p + k * mRefSize, mRefSize), depth + 1);
+          if (!item) return std::nullopt;
+          array.push_back(std::move(*item));
+        }
+        return Value(std::move(array));
+      }
+      case 0xD: {
+        if (depth >= kMaxNestingDepth) return std::nullopt;
+        std::vector<Dictionary::Entry> entries;
+        entries.reserve(o.count);
+        const uint8_t* values = p + o.count * mRefSize;
+        for (uint64_t k = 0; k < o.count; ++k) {
+          Object key;
+          if (!readObject(ReadBigEndian(p + k * mRefSize, mRefSize), key)) return std::nullopt;
+          std::optional<std::string> keyText = textOf(key);
+          if (!keyText) return std::nullopt;
+          std::optional<Value> item =
+              valueOf(ReadBigEndian(values + k * mRefSize, mRefSize), depth + 1);
+          if (!item) return std::nullopt;
+          entries.emplace_back(std::move(*keyText), std::move(*item));
+        }
+        return Value(Dictionary::FromEntries(std::move(entries)));
+      }
+      default:
+        return std::nullopt;
+    }
   }
 
   bool isStringObject(uint64_t index) const {
@@ -429,12 +595,15 @@ class BinaryChecker {
   uint64_t mObjectsEnd = 0;
   const uint8_t* mTable = nullptr;
   uint64_t mCount = 0;
+  uint64_t mTop = 0;
   uint64_t mBudget = 0;
+  uint64_t mByteBudget = 0;
   std::vector<State> mState;
   // Per declared object, so kept narrow: heights are at most kMaxNestingDepth and expanded
-  // sizes at most the budget, which is below 2^32 for any input within kMaxFileSize.
+  // sizes at most their budgets, which are below 2^32 for any input within kMaxFileSize.
   std::vector<uint16_t> mHeight;
   std::vector<uint32_t> mExpanded;
+  std::vector<uint32_t> mExpandedBytes;
 };
 
 // ---------------------------------------------------------------------------------------------
@@ -656,12 +825,9 @@ std::optional<Value> ReadXml(std::string_view xml) {
 }
 
 std::optional<Value> ReadBinary(std::string_view bytes) {
-  if (!BinaryChecker(bytes).check()) return std::nullopt;
-  plist_t root = nullptr;
-  plist_from_bin(bytes.data(), static_cast<uint32_t>(bytes.size()), &root);
-  if (!root) return std::nullopt;
-  NodePtr owner(root);
-  return ValueOfNode(root, 0);
+  BinaryChecker checker(bytes);
+  if (!checker.check()) return std::nullopt;
+  return checker.read();
 }
 
 }  // namespace

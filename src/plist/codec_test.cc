@@ -167,6 +167,10 @@ TEST(PropertyListBinary, ReadsFractionalDatesWideIntegersAndUids) {
   // Past the 64-bit range: refused rather than wrapped.
   EXPECT_FALSE(
       ReadPropertyList(BinaryList({"\x14" + std::string(8, '\0') + std::string(8, '\xFF')})));
+  // Dates outside years 1 to 9999, which no other form holds, are refused: 1e12 and NaN.
+  EXPECT_FALSE(ReadPropertyList(BinaryList({"\x33\x42\x6D\x1A\x94\xA2\x00\x00\x00"s})));
+  EXPECT_FALSE(ReadPropertyList(BinaryList({"\x33\x7F\xF8\x00\x00\x00\x00\x00\x00"s})));
+  EXPECT_EQ(ReadPropertyList(BinaryList({"\x60"s})), Value(""));
 }
 
 TEST(PropertyListText, RoundTripsEveryKindThroughDescribe) {
@@ -362,6 +366,45 @@ TEST(PropertyListHostile, SharedObjectsCannotMultiplyTheTree) {
   };
   EXPECT_TRUE(ReadPropertyList(sharedBelowChain(kMaxNestingDepth - 3)));
   EXPECT_FALSE(ReadPropertyList(sharedBelowChain(kMaxNestingDepth - 2)));
+}
+
+// A payload object: ASCII string (0x5), data (0x4) or UTF-16 string (0x6) of `length` units.
+std::string Payload(char type, size_t length) {
+  const size_t bytes = type == 0x6 ? 2 * length : length;
+  return std::string(1, static_cast<char>(type << 4 | 0x0F)) + "\x11" + BigEndian(length, 2) +
+         std::string(bytes, type == 0x6 ? '\x01' : 'p');
+}
+
+// An array of `references` two-byte references to object 1.
+std::string SharedPayloadArray(const std::string& payload, size_t references) {
+  return BinaryList(
+      {"\xAF\x11" + BigEndian(references, 2) + Repeat(Ref(1, 2), references), payload}, 2);
+}
+
+TEST(PropertyListHostile, SharedPayloadsAreCountedAtEveryReference) {
+  // 64 KB that would expand to 1 GB: 32,000 references to one 32,000-byte payload.
+  for (char type : {'\x05', '\x04', '\x06'}) {
+    EXPECT_FALSE(ReadPropertyList(SharedPayloadArray(Payload(type, 32000), 32000))) << int{type};
+  }
+  // The same in a dictionary, where the payload is both every key and every value.
+  const std::string bigKey = Payload(0x5, 32000);
+  EXPECT_FALSE(
+      ReadPropertyList(BinaryList({"\xDF\x11\x3E\x80" + Repeat(Ref(1, 2), 2 * 16000), bigKey}, 2)));
+  // A list reads exactly while what it expands to fits MaxExpandedBytes of its size (one
+  // UTF-16 unit counted as three bytes).
+  for (char type : {'\x05', '\x04', '\x06'}) {
+    const size_t length = 4096;
+    int read = 0;
+    for (size_t references = 1; references <= 80; ++references) {
+      const std::string bytes = SharedPayloadArray(Payload(type, length), references);
+      const uint64_t expanded = references * length * (type == 0x6 ? 3 : 1);
+      EXPECT_EQ(ReadPropertyList(bytes).has_value(), expanded <= MaxExpandedBytes(bytes.size()))
+          << int{type} << " x" << references;
+      read += expanded <= MaxExpandedBytes(bytes.size());
+    }
+    EXPECT_GT(read, 5);
+    EXPECT_LT(read, 80);
+  }
 }
 
 TEST(PropertyListHostile, XmlScalarsMustMeanWhatTheySay) {

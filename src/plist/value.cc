@@ -329,13 +329,15 @@ std::vector<std::string> Dictionary::sortedKeys() const {
 }
 
 bool IsFormattableDate(Date date) {
-  const double seconds = std::floor(date.secondsSince2001 + kUnixTimeOfReferenceDate);
+  const double seconds = std::floor(date.secondsSince2001) + kUnixTimeOfReferenceDate;
   // 0001-01-01 00:00:00 to 9999-12-31 23:59:59 UTC, in Unix seconds; NaN fails both.
   return seconds >= -62135596800.0 && seconds <= 253402300799.0;
 }
 
 std::string FormatDate(Date date, bool localTime) {
-  double seconds = std::floor(date.secondsSince2001 + kUnixTimeOfReferenceDate);
+  // Whole seconds since 2001 first, as the XML writer takes them: the shift to 1970 would
+  // round away a fraction too small for its magnitude (-1e-9 would show as 00:00:00).
+  double seconds = std::floor(date.secondsSince2001) + kUnixTimeOfReferenceDate;
   if (!IsFormattableDate(date)) seconds = kUnixTimeOfReferenceDate;
   const time_t t = static_cast<time_t>(seconds);
   struct tm tm {};

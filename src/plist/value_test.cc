@@ -64,6 +64,9 @@ TEST(ParseDate, ReadsBackWhatFormatDateWrites) {
     ASSERT_TRUE(ParseDate(text)) << text;
     EXPECT_EQ(ParseDate(text)->secondsSince2001, s) << text;
   }
+  // A date shows its whole second, the one it falls in, however small its fraction.
+  EXPECT_EQ(FormatDate(Date{-1e-9}, false), "2000-12-31 23:59:59 +0000");
+  EXPECT_EQ(FormatDate(Date{-10.25}, false), "2000-12-31 23:59:49 +0000");
   // Local time with its offset names the same instant.
   EXPECT_EQ(ParseDate("2001-01-01 02:30:00 +0230")->secondsSince2001, 0);
   EXPECT_EQ(ParseDate("2000-12-31 23:00:00 -0100")->secondsSince2001, 0);

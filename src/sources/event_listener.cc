@@ -44,6 +44,11 @@ uint64_t NowMicroseconds() {
 
 }  // namespace
 
+std::optional<plist::Value> ReadEventPacket(std::string_view packet) {
+  if (packet.empty() || !LooksLikeWireFormat(packet)) return std::nullopt;
+  return plist::ReadPropertyList(packet);
+}
+
 std::optional<plist::Dictionary> ConvertXPCEvent(const plist::Dictionary& message, uint32_t uid,
                                                  uint32_t gid) {
   LogMessage(3, "\tdictionary count = %d", static_cast<int>(message.size()));
@@ -170,9 +175,8 @@ void PeerConnections::onReadable(Peer& peer, uint32_t) {
 void PeerConnections::handleMessage(Peer& peer, size_t length) {
   const int uid = AsPrinted(peer.credentials.uid);
   const int gid = AsPrinted(peer.credentials.gid);
-  const std::string_view bytes(reinterpret_cast<const char*>(mBuffer.data()), length);
-  std::optional<plist::Value> message;
-  if (length > 0 && LooksLikeWireFormat(bytes)) message = plist::ReadPropertyList(bytes);
+  const std::optional<plist::Value> message =
+      ReadEventPacket({reinterpret_cast<const char*>(mBuffer.data()), length});
 
   if (!message) {
     LogMessage(3, "_CFXPCCreateCFObjectFromXPCObject returned NULL");

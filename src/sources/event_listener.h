@@ -10,6 +10,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/seqpacket.h"
@@ -26,6 +27,10 @@ inline constexpr const char* kDefaultEventSocketPath = "/run/tarvod/com.quenta.t
 inline constexpr size_t kMaxEventMessageBytes = 1024 * 1024;
 // Open connections at most; further connections wait in the listen backlog until one closes.
 inline constexpr size_t kMaxPeerConnections = 256;
+
+// The property list one packet carries: nullopt when the packet is empty, in neither wire
+// format (XML or binary) or malformed. Pure; any thread.
+std::optional<plist::Value> ReadEventPacket(std::string_view packet);
 
 // The message dictionary with senderUID and senderGID added ("%d" of the effective IDs)
 // unless the sender set them.
