@@ -63,7 +63,8 @@ run: build
 # run for FUZZ_SECONDS over its committed seeds; inputs it finds go to build-fuzz/corpus/TARGET,
 # crashes to build-fuzz/artifacts/. fuzz/TARGET.flags adds libFuzzer options for one target.
 FUZZ_SECONDS ?= 60
-FUZZ_TARGETS := plist_xml plist_binary plist_text context criteria bsm_record event_packet
+FUZZ_TARGETS := plist_xml plist_binary plist_text context criteria bsm_record event_packet \
+  rules_file ssh_log
 FUZZ_PACKAGES := clang libclang-rt-14-dev
 .PHONY: fuzz
 fuzz: deps
