@@ -80,7 +80,7 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
       }
       if (resolved && resolved->isDictionary()) {
         for (const auto& [key, value] : resolved->dictionary()) {
-          attributes.emplace_back(key, value.textForm());
+          attributes.emplace_back(context.shownText(key), context.shownValue(value));
         }
       }
     }
@@ -140,7 +140,8 @@ void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule, 
   const auto resolvedMessage = ResolveActionText(action, "message", rule, context);
   if (!resolvedMessage) return;
   if (!*resolvedMessage || (*resolvedMessage)->empty()) return;
-  const std::string message = UnescapeColonsInString(**resolvedMessage);
+  // A log line is no place for a secret: keychain values are written as the placeholder.
+  const std::string message = context.shownText(UnescapeColonsInString(**resolvedMessage));
   if (message.empty()) return;
 
   const auto logType = ResolveActionText(action, "logType", rule, context);
