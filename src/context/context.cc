@@ -158,12 +158,15 @@ std::string Context::shownText(std::string_view text) const {
   return mKeychain->mask(text);
 }
 
-std::string Context::shownValue(const std::optional<plist::Value>& value) const {
-  if (!value) return "(null)";
-  if (!mKeychain || !mKeychain->hasSecrets()) return value->textForm();
+std::string Context::shownValue(const plist::Value& value) const {
+  if (!mKeychain || !mKeychain->hasSecrets()) return value.textForm();
   // Masked before the text form is made: the old-style form quotes and escapes strings, and
   // an escaped secret would no longer be found in it.
-  return MaskedValue(*mKeychain, *value).textForm();
+  return MaskedValue(*mKeychain, value).textForm();
+}
+
+std::string Context::shownValue(const std::optional<plist::Value>& value) const {
+  return value ? shownValue(*value) : "(null)";
 }
 
 std::string Context::variablesDescription() const {

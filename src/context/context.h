@@ -79,6 +79,7 @@ class Context {
   // What traces, dumps and log lines print: the text, or a value's text form (nullopt is
   // "(null)"), with every secret text of the keychain shown as kSecretPlaceholder.
   std::string shownText(std::string_view text) const;
+  std::string shownValue(const plist::Value& value) const;
   std::string shownValue(const std::optional<plist::Value>& value) const;
   // The variable store's text form, shown as above.
   std::string variablesDescription() const;

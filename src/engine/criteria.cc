@@ -212,8 +212,7 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
   if (*code < 16) {
     second = operands.size() > 1 ? &operands[1] : nullptr;
     LogMessage(2, "    Evaluating criteria: %s %s %s", context.shownValue(first).c_str(),
-               keyword.c_str(),
-               context.shownValue(second ? std::optional<Value>(*second) : std::nullopt).c_str());
+               keyword.c_str(), second ? context.shownValue(*second).c_str() : "(null)");
   }
   return Decide(*code, first, second, context, filePath).value_or(false);
 }
