@@ -5,7 +5,9 @@
 // main thread is still writing its own lines between theirs.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
+#include <cstdio>
 #include <functional>
 #include <string>
 #include <vector>
@@ -26,11 +28,12 @@ class DispatchTest : public ::testing::Test {
   // stops it (the shutdown event's rules run before it exits). Returns the error log.
   std::string run(const std::vector<std::string>& rules, int level,
                   const std::function<void(Daemon&)>& whileRunning = {}) {
-    const std::string config =
-        dir.write("tarvod.plist", ConfigPlist({{"errorLogPath", Str(errorLog)},
-                                               {"structuredLogPath", Str(records)},
-                                               {"eventSocketPath", Str(socket)},
-                                               {"stateDirectory", Str(dir.path())}}));
+    std::vector<std::pair<std::string, std::string>> settings{{"errorLogPath", Str(errorLog)},
+                                                              {"structuredLogPath", Str(records)},
+                                                              {"eventSocketPath", Str(socket)},
+                                                              {"stateDirectory", Str(dir.path())}};
+    settings.insert(settings.end(), extraConfig.begin(), extraConfig.end());
+    const std::string config = dir.write("tarvod.plist", ConfigPlist(settings));
     dir.write("rules.plist", RulesDocument(rules));
     Daemon daemon({"-c", config, "-r", rulesPath, "-v", std::to_string(level), "-n"}, dir);
     EXPECT_TRUE(daemon.waitForLine(errorLog, "EVENT RECEIVED: startup.load"))
@@ -63,6 +66,7 @@ class DispatchTest : public ::testing::Test {
   }
 
   TempDir dir;
+  std::vector<std::pair<std::string, std::string>> extraConfig;  // more config entries for run
   const std::string errorLog = dir.file("error.log");
   const std::string records = dir.file("records.jsonl");
   const std::string socket = dir.file("evtq");
@@ -275,6 +279,100 @@ TEST_F(DispatchTest, LogActionWritesFileLinesByteForByteAndStructuredMessagesInt
   const std::vector<std::pair<std::string, std::string>> attributes = {{"Facility", "auth"},
                                                                        {"source", "tarvod"}};
   EXPECT_EQ(kv[0].attributes, attributes);
+}
+
+// The administrator stores a password with tarvodctl; rules read it, and nothing the daemon
+// writes shows it: not the error log at level 6, the event log, the records, a log action's
+// file or a debugdump.
+TEST_F(DispatchTest, KeychainValuesReachRulesButNoLogShowsThem) {
+  const std::string store = dir.file("etc/system.keychain");
+  const std::string secret = "Hunter2-s3cr3t";
+  auto keychain = [&](std::vector<std::string> args, std::string_view input = {}) {
+    args.insert(args.begin(), {TarvodctlBinary(), "keychain", "--keychain", store});
+    return RunProgram(args, input);
+  };
+  RunResult result = keychain({"set", "mail.example.com", "relay"}, secret + "\n");
+  ASSERT_EQ(result.status, 0) << result.err;
+  ASSERT_EQ(keychain({"set", "old.example.com", "x"}, "gone").status, 0);
+  EXPECT_EQ(keychain({"delete", "old.example.com", "x"}).status, 0);
+  EXPECT_EQ(keychain({"get", "mail.example.com", "relay"}).out, secret + "\n");
+  EXPECT_EQ(keychain({"list"}).out, "mail.example.com\trelay\n");
+  result = keychain({"get", "old.example.com", "x"});
+  EXPECT_EQ(result.status, 1);
+  EXPECT_THAT(result.err, HasSubstr("no item for service 'old.example.com' and account 'x'"));
+  struct stat info {};
+  ASSERT_EQ(stat(store.c_str(), &info), 0);
+  EXPECT_EQ(info.st_mode & 07777, 0600u);
+  EXPECT_EQ(info.st_uid, 0u);
+
+  const std::string eventLog = dir.file("events.log");
+  extraConfig = {
+      {"keychainPath", Str(store)}, {"logEvents", Int(1)}, {"eventLogPath", Str(eventLog)}};
+  const std::string password = "${keychain:relay@mail.example.com}";
+  const std::string log = run(
+      {RuleXml(
+          "uses the password", {"test.secret"},
+          {{"criterion", Arr({Criterion("notequal", {Str(password), Str("${event:guess}")})})},
+           {"variables", Dict({{"global:pw", Str(password)}, {"line", Str("pass " + password)}})},
+           {"actions", Arr({FileLog("file " + password, out),
+                            Dict({{"type", Str("log")},
+                                  {"logType", Str("kvlog")},
+                                  {"message", Str("record " + password)},
+                                  {"details", Dict({{"pw", Str(password)}})}}),
+                            Dict({{"type", Str("debugdump")}, {"data", Str("all")}}),
+                            Dict({{"type", Str("debugdump")}, {"data", Str("globals")}})})}})},
+      6, [&](Daemon& daemon) {
+        send({"test.secret", "guess=wrong"});
+        EXPECT_TRUE(daemon.waitForLine(errorLog, "Globals = "));
+      });
+
+  for (const std::string& written : {log, ReadFile(eventLog), ReadFile(records), ReadFile(out)}) {
+    EXPECT_THAT(written, Not(HasSubstr(secret)));
+  }
+  // The password was there to be hidden: the rule fired with it.
+  EXPECT_EQ(ReadFile(out), "file <keychain value>\n");
+  EXPECT_THAT(log, HasSubstr("  Set variable: pw = <keychain value>\n"));
+  EXPECT_THAT(log, HasSubstr("  Set variable: line = pass <keychain value>\n"));
+  bool sawRecord = false;
+  for (const auto& record : ReadJsonRecords(records)) {
+    if (record.message != "record <keychain value>") continue;
+    sawRecord = true;
+    EXPECT_EQ(record.attribute("pw"), "<keychain value>");
+  }
+  EXPECT_TRUE(sawRecord);
+}
+
+// tarvodctl refuses to touch the store unless it runs as root and the store is root's alone,
+// and never rewrites a store it cannot read.
+TEST_F(DispatchTest, TarvodctlKeychainRefusals) {
+  const std::string store = dir.write("system.keychain", "not a property list");
+  chmod(store.c_str(), 0600);
+  auto keychain = [&](std::vector<std::string> args, std::string_view input = {}) {
+    args.insert(args.begin(), {TarvodctlBinary(), "keychain", "--keychain", store});
+    return RunProgram(args, input);
+  };
+  RunResult result =
+      RunProgram({"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups",
+                  TarvodctlBinary(), "keychain", "--keychain", store, "list"});
+  EXPECT_EQ(result.status, 1);
+  EXPECT_THAT(result.err, HasSubstr("tarvodctl: keychain commands must be run as root"));
+
+  result = keychain({"set", "s", "a"}, "pw");
+  EXPECT_EQ(result.status, 1);
+  EXPECT_THAT(result.err, HasSubstr(store + " is not a property-list array"));
+  EXPECT_EQ(ReadFile(store), "not a property list");
+
+  chmod(store.c_str(), 0640);
+  result = keychain({"list"});
+  EXPECT_EQ(result.status, 1);
+  EXPECT_THAT(result.err, HasSubstr("has group or other permission bits (mode 0640)"));
+
+  std::remove(store.c_str());
+  result = keychain({"set", "s", "a"}, "\n");
+  EXPECT_EQ(result.status, 1);
+  EXPECT_THAT(result.err, HasSubstr("the password is empty"));
+  EXPECT_EQ(keychain({"get", "s"}).status, 2);
+  EXPECT_EQ(keychain({"frob", "s", "a"}).status, 2);
 }
 
 }  // namespace

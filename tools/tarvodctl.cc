@@ -1,20 +1,33 @@
-// tarvodctl: sends an event to a running tarvod over its event socket.
+// tarvodctl: sends an event to a running tarvod over its event socket, and edits the keychain
+// store that "keychain:" references read.
 //
 //   tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]
 //   tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE
+//   tarvodctl [-c CONFIG] keychain [--keychain PATH] set SERVICE ACCOUNT
+//   tarvodctl [-c CONFIG] keychain [--keychain PATH] get|delete SERVICE ACCOUNT
+//   tarvodctl [-c CONFIG] keychain [--keychain PATH] list
 //
 // The first form sends { eventType = TYPE; eventDetails = { key = value; ... }; }, the second
 // the dictionary in a property-list file. Without --socket the path is the configuration
 // file's eventSocketPath (default configuration /etc/tarvod.d/tarvod.plist), else the
-// daemon's default. Exit status: 0 sent, 1 not sent, 2 usage.
+// daemon's default. The keychain forms work on the configuration's keychainPath unless
+// --keychain names the store; they run only as root. set reads the password from standard
+// input (without echo on a terminal). Exit status: 0 done, 1 failed (not sent, no such item,
+// refused), 2 usage.
+#include <termios.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "context/keychain.h"
+#include "platform/files.h"
+#include "platform/secret_file.h"
 #include "platform/seqpacket.h"
 #include "plist/codec.h"
 #include "plist/value.h"
@@ -24,10 +37,16 @@ namespace {
 
 constexpr const char* kDefaultConfiguration = "/etc/tarvod.d/tarvod.plist";
 
+// A password longer than this is no password: set refuses it.
+constexpr size_t kMaxPasswordBytes = 64 * 1024;
+
 int Usage() {
   std::fprintf(stderr,
                "usage: tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]\n"
-               "       tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE\n");
+               "       tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE\n"
+               "       tarvodctl [-c CONFIG] keychain [--keychain PATH] set|get|delete SERVICE "
+               "ACCOUNT\n"
+               "       tarvodctl [-c CONFIG] keychain [--keychain PATH] list\n");
   return 2;
 }
 
@@ -36,15 +55,17 @@ int Fail(const std::string& message) {
   return 1;
 }
 
-std::string SocketPathFromConfiguration(const std::string& configurationPath) {
+// The configuration file's config entry for key when it is a string, else fallback.
+std::string ConfigurationPath(const std::string& configurationPath, std::string_view key,
+                              const char* fallback) {
   if (const auto file = plist::ReadPropertyListFile(configurationPath)) {
     if (const plist::Dictionary* root = file->asDictionary()) {
       if (const plist::Dictionary* config = root->findDictionary("config")) {
-        if (const std::string* path = config->findString("eventSocketPath")) return *path;
+        if (const std::string* path = config->findString(key)) return *path;
       }
     }
   }
-  return tarvod::kDefaultEventSocketPath;
+  return fallback;
 }
 
 struct Command {
@@ -86,11 +107,185 @@ bool Parse(const std::vector<std::string>& args, Command& command) {
   return true;
 }
 
+struct KeychainCommand {
+  std::string configurationPath = kDefaultConfiguration;
+  std::optional<std::string> storePath;
+  std::string verb;
+  std::vector<std::string> operands;  // SERVICE ACCOUNT
+};
+
+// Parses "keychain" command lines; false on a usage error.
+bool ParseKeychain(const std::vector<std::string>& args, KeychainCommand& command) {
+  bool sawKeychain = false;
+  for (size_t i = 0; i < args.size(); ++i) {
+    const std::string& arg = args[i];
+    if (arg == "-c" || arg == "--keychain") {
+      if (i + 1 == args.size()) return false;
+      (arg == "-c" ? command.configurationPath : command.storePath.emplace()) = args[++i];
+    } else if (!sawKeychain) {
+      if (arg != "keychain") return false;
+      sawKeychain = true;
+    } else if (command.verb.empty()) {
+      command.verb = arg;
+    } else {
+      command.operands.push_back(arg);
+    }
+  }
+  if (command.verb == "list") return command.operands.empty();
+  if (command.verb == "set" || command.verb == "get" || command.verb == "delete") {
+    return command.operands.size() == 2;
+  }
+  return false;
+}
+
+// The password from standard input: one line typed without echo on a terminal, else
+// everything up to the end of the input. One trailing line break is not part of it.
+std::optional<std::string> ReadPassword() {
+  const bool terminal = isatty(STDIN_FILENO) == 1;
+  termios saved{};
+  if (terminal) {
+    tcgetattr(STDIN_FILENO, &saved);
+    termios quiet = saved;
+    quiet.c_lflag &= ~static_cast<tcflag_t>(ECHO);
+    tcsetattr(STDIN_FILENO, TCSAFLUSH, &quiet);
+    std::fprintf(stderr, "Password: ");
+  }
+  std::string password;
+  bool tooLong = false;
+  char c;
+  for (;;) {
+    const ssize_t n = read(STDIN_FILENO, &c, 1);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0 || (terminal && c == '\n')) break;
+    if (password.size() == kMaxPasswordBytes) {
+      tooLong = true;
+      break;
+    }
+    password.push_back(c);
+  }
+  if (terminal) {
+    tcsetattr(STDIN_FILENO, TCSAFLUSH, &saved);
+    std::fputc('\n', stderr);
+  }
+  if (tooLong) return std::nullopt;
+  if (password.ends_with('\n')) password.pop_back();
+  if (password.ends_with('\r')) password.pop_back();
+  return password;
+}
+
+// Text that an XML property list carries as a string: UTF-8 without control characters other
+// than tab. Anything else is stored as data, which lookups decode the same way.
+plist::Value PasswordValue(const std::string& password) {
+  bool plain = plist::IsValidUtf8(password);
+  for (const char c : password) {
+    if (static_cast<unsigned char>(c) < 0x20 && c != '\t') plain = false;
+  }
+  if (plain) return plist::Value(password);
+  return plist::Value::FromData(plist::Data(password.begin(), password.end()));
+}
+
+int RunKeychain(const KeychainCommand& command) {
+  // The store is root's alone; anyone else could neither read it nor leave it root-only.
+  if (geteuid() != 0) return Fail("keychain commands must be run as root");
+  const std::string path = command.storePath
+                               ? *command.storePath
+                               : ConfigurationPath(command.configurationPath, "keychainPath",
+                                                   tarvod::kDefaultKeychainPath);
+
+  // A store the daemon would refuse is not edited either: its secrets may already be exposed,
+  // and rewriting it would hide that.
+  plist::Array items;
+  tarvod::Result<tarvod::SecretFile> file = tarvod::ReadSecretFile(path);
+  if (file.ok()) {
+    std::optional<plist::Value> store = plist::ReadPropertyList(file.value().bytes);
+    if (!store || !store->isArray()) return Fail(path + " is not a property-list array");
+    items = std::move(store->array());
+  } else if (file.status().error() != ENOENT) {
+    return Fail(file.status().what());
+  }
+
+  if (command.verb == "list") {
+    for (const plist::Value& item : items) {
+      const plist::Dictionary* dictionary = item.asDictionary();
+      const std::string* service = dictionary ? dictionary->findString("service") : nullptr;
+      const std::string* account = dictionary ? dictionary->findString("account") : nullptr;
+      if (service && account) std::printf("%s\t%s\n", service->c_str(), account->c_str());
+    }
+    return 0;
+  }
+
+  const std::string& service = command.operands[0];
+  const std::string& account = command.operands[1];
+  const std::optional<size_t> index = tarvod::FindKeychainItem(items, service, account);
+  if (command.verb != "set" && !index) {
+    return Fail("no item for service '" + service + "' and account '" + account + "'");
+  }
+  if (command.verb == "get") {
+    const plist::Value* password = items[*index].asDictionary()->find("password");
+    if (password && password->isString()) {
+      std::printf("%s\n", password->string().c_str());
+    } else if (password && password->isData()) {
+      std::fwrite(password->data().data(), 1, password->data().size(), stdout);
+      std::fputc('\n', stdout);
+    } else {
+      return Fail("the item's password is neither a string nor data");
+    }
+    return 0;
+  }
+
+  if (command.verb == "delete") {
+    items.erase(items.begin() + static_cast<std::ptrdiff_t>(*index));
+  } else {
+    const std::optional<std::string> password = ReadPassword();
+    if (!password) return Fail("the password is longer than 65536 bytes");
+    if (password->empty()) return Fail("the password is empty");
+    if (index) {
+      items[*index].asDictionary()->set("password", PasswordValue(*password));
+    } else {
+      items.push_back(plist::Value(plist::Dictionary{{"service", plist::Value(service)},
+                                                     {"account", plist::Value(account)},
+                                                     {"password", PasswordValue(*password)}}));
+    }
+  }
+  const std::optional<std::string> bytes = plist::WriteXmlPropertyList(plist::Value(items));
+  if (!bytes) return Fail("the store cannot be written as a property list");
+  tarvod::Files& files = tarvod::Files::Real();
+  if (const size_t slash = path.rfind('/'); slash != std::string::npos && slash > 0) {
+    files.makeDirectories(path.substr(0, slash), 0755);
+  }
+  // Written to a new 0600 file of root's, synced and renamed over the store: the daemon reads
+  // the old store or the new one, never a part.
+  const tarvod::Status written = files.writeAtomically(path, *bytes);
+  if (!written.ok()) {
+    return Fail("cannot write " + path + ": " + written.what() + ": " +
+                std::strerror(written.error()));
+  }
+  return 0;
+}
+
+// Whether the first word after the options is "keychain".
+bool IsKeychainCommand(const std::vector<std::string>& args) {
+  for (size_t i = 0; i < args.size(); ++i) {
+    if (args[i] == "-c" || args[i] == "--keychain") {
+      ++i;
+      continue;
+    }
+    return args[i] == "keychain";
+  }
+  return false;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
+  const std::vector<std::string> args(argv + 1, argv + argc);
+  if (IsKeychainCommand(args)) {
+    KeychainCommand keychain;
+    if (!ParseKeychain(args, keychain)) return Usage();
+    return RunKeychain(keychain);
+  }
   Command command;
-  if (!Parse(std::vector<std::string>(argv + 1, argv + argc), command)) return Usage();
+  if (!Parse(args, command)) return Usage();
 
   plist::Dictionary message;
   if (command.plistPath) {
@@ -119,7 +314,8 @@ int main(int argc, char** argv) {
 
   const std::string path = command.socketPath
                                ? *command.socketPath
-                               : SocketPathFromConfiguration(command.configurationPath);
+                               : ConfigurationPath(command.configurationPath, "eventSocketPath",
+                                                   tarvod::kDefaultEventSocketPath);
   const tarvod::SocketResult connection = tarvod::ConnectSeqpacket(path);
   if (connection.fd < 0) return Fail("tarvod is not listening: " + connection.error);
   std::string error;

@@ -14,8 +14,7 @@ void DebugDumpAction::perform(const plist::Dictionary& action, const FiredRule& 
     LogMessage(2, "inRule = %s", plist::Describe(rule.rule).c_str());
     LogMessage(2, "inContext = %s", context.description().c_str());
   } else if (*data == "globals") {
-    const std::string text =
-        context.variables() ? plist::Describe(*context.variables()) : std::string("(nil)");
+    const std::string text = context.variables() ? context.variablesDescription() : "(nil)";
     LogMessage(2, "Globals = %s", text.c_str());
   } else if (*data == "rulebase") {
     const std::string text = context.rulebase()

@@ -84,9 +84,9 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
         const bool hasFacility = !attributes.empty();
         for (const auto& [key, value] : resolved->dictionary()) {
           if (hasFacility && key == attributes.front().first) {
-            attributes.front().second = value.textForm();
+            attributes.front().second = context.shownValue(value);
           } else {
-            attributes.emplace_back(key, value.textForm());
+            attributes.emplace_back(context.shownText(key), context.shownValue(value));
           }
         }
       }
@@ -147,7 +147,8 @@ void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule, 
   const auto resolvedMessage = ResolveActionText(action, "message", rule, context);
   if (!resolvedMessage) return;
   if (!*resolvedMessage || (*resolvedMessage)->empty()) return;
-  const std::string message = UnescapeColonsInString(**resolvedMessage);
+  // A log line is no place for a secret: keychain values are written as the placeholder.
+  const std::string message = context.shownText(UnescapeColonsInString(**resolvedMessage));
   if (message.empty()) return;
 
   const auto logType = ResolveActionText(action, "logType", rule, context);

@@ -201,8 +201,9 @@ void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule&
   request.identity = std::move(identity);
 
   if (DebugLevel() >= 3) {
-    LogMessage(3, "    Executing command:\n      %s %s", request.program.c_str(),
-               QuotedArguments(arguments).c_str());
+    // An argument may carry a keychain password: the trace shows it masked.
+    LogMessage(3, "    Executing command:\n      %s %s", context.shownText(request.program).c_str(),
+               context.shownText(QuotedArguments(arguments)).c_str());
   }
   Result<ChildProcess> child = mLauncher.launch(request);
   if (!child.ok()) return;

@@ -29,6 +29,36 @@ void ForEachColon(std::string_view text, Visit visit) {
   }
 }
 
+plist::Dictionary MaskedDictionary(const Keychain& keychain, const plist::Dictionary& dictionary);
+
+// A copy of value with every secret text in its strings (and dictionary keys) masked.
+plist::Value MaskedValue(const Keychain& keychain, const plist::Value& value) {
+  if (const std::string* text = value.asString()) return plist::Value(keychain.mask(*text));
+  if (const plist::Dictionary* dictionary = value.asDictionary()) {
+    return plist::Value(MaskedDictionary(keychain, *dictionary));
+  }
+  if (const plist::Array* array = value.asArray()) {
+    plist::Array masked;
+    masked.reserve(array->size());
+    for (const plist::Value& element : *array) masked.push_back(MaskedValue(keychain, element));
+    return plist::Value(std::move(masked));
+  }
+  // A number computed from a secret is shown as the placeholder, as a string.
+  if (!value.isData() && keychain.isSecret(value)) {
+    return plist::Value(keychain.mask(value.textForm()));
+  }
+  return value;
+}
+
+plist::Dictionary MaskedDictionary(const Keychain& keychain, const plist::Dictionary& dictionary) {
+  std::vector<plist::Dictionary::Entry> entries;
+  entries.reserve(dictionary.size());
+  for (const auto& [key, value] : dictionary) {
+    entries.emplace_back(keychain.mask(key), MaskedValue(keychain, value));
+  }
+  return plist::Dictionary::FromEntries(std::move(entries));
+}
+
 }  // namespace
 
 std::string EscapeColonsInEventString(std::string_view text) {
@@ -72,11 +102,15 @@ bool UnescapedColonsInString(std::string_view text) {
   return found;
 }
 
-Context::Context(VariableStorePtr variables, RulebasePtr rulebase)
-    : mVariables(std::move(variables)), mRulebase(std::move(rulebase)) {}
+Context::Context(VariableStorePtr variables, RulebasePtr rulebase,
+                 std::shared_ptr<Keychain> keychain)
+    : mVariables(std::move(variables)),
+      mRulebase(std::move(rulebase)),
+      mKeychain(std::move(keychain)) {}
 
-Context::Context(VariableStorePtr variables, RulebasePtr rulebase, const plist::Dictionary& event)
-    : Context(std::move(variables), std::move(rulebase)) {
+Context::Context(VariableStorePtr variables, RulebasePtr rulebase, const plist::Dictionary& event,
+                 std::shared_ptr<Keychain> keychain)
+    : Context(std::move(variables), std::move(rulebase), std::move(keychain)) {
   setEvent(event);
 }
 
@@ -119,9 +153,31 @@ const StatContext* Context::stats() {
   return mStats.get();
 }
 
+std::string Context::shownText(std::string_view text) const {
+  if (!mKeychain) return std::string(text);
+  return mKeychain->mask(text);
+}
+
+std::string Context::shownValue(const plist::Value& value) const {
+  if (!mKeychain || !mKeychain->hasSecrets()) return value.textForm();
+  // Masked before the text form is made: the old-style form quotes and escapes strings, and
+  // an escaped secret would no longer be found in it.
+  return MaskedValue(*mKeychain, value).textForm();
+}
+
+std::string Context::shownValue(const std::optional<plist::Value>& value) const {
+  return value ? shownValue(*value) : "(null)";
+}
+
+std::string Context::variablesDescription() const {
+  if (!mVariables) return "(null)";
+  if (!mKeychain || !mKeychain->hasSecrets()) return plist::Describe(*mVariables);
+  return plist::Describe(MaskedDictionary(*mKeychain, *mVariables));
+}
+
 std::string Context::description() const {
   const std::string event = mEvent ? plist::Describe(*mEvent) : "(null)";
-  const std::string variables = mVariables ? plist::Describe(*mVariables) : "(null)";
+  const std::string variables = variablesDescription();
   const std::string rulebase = mRulebase ? plist::Describe(RulebaseToValue(*mRulebase)) : "(null)";
   return "event = " + event + " \n variables = " + variables + " \n rulebase = " + rulebase;
 }

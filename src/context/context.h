@@ -13,6 +13,7 @@
 #include <string>
 #include <string_view>
 
+#include "context/keychain.h"
 #include "context/types.h"
 #include "platform/host_stats.h"
 #include "plist/value.h"
@@ -30,9 +31,12 @@ using ErrorSlot = std::optional<SubstitutionError>;
 
 class Context {
  public:
-  // initWithVariables:andRulebase: / initWithVariables:andRulebase:andEvent:
-  Context(VariableStorePtr variables, RulebasePtr rulebase);
-  Context(VariableStorePtr variables, RulebasePtr rulebase, const plist::Dictionary& event);
+  // initWithVariables:andRulebase: / initWithVariables:andRulebase:andEvent:. Without a
+  // keychain, "keychain:" references have no value.
+  Context(VariableStorePtr variables, RulebasePtr rulebase,
+          std::shared_ptr<Keychain> keychain = nullptr);
+  Context(VariableStorePtr variables, RulebasePtr rulebase, const plist::Dictionary& event,
+          std::shared_ptr<Keychain> keychain = nullptr);
   ~Context();
   Context(const Context&) = delete;
   Context& operator=(const Context&) = delete;
@@ -72,12 +76,21 @@ class Context {
                                                        std::string_view rulesFile,
                                                        ErrorSlot* error);
 
+  // What traces, dumps and log lines print: the text, or a value's text form (nullopt is
+  // "(null)"), with every secret text of the keychain shown as kSecretPlaceholder.
+  std::string shownText(std::string_view text) const;
+  std::string shownValue(const plist::Value& value) const;
+  std::string shownValue(const std::optional<plist::Value>& value) const;
+  // The variable store's text form, shown as above.
+  std::string variablesDescription() const;
+
   // "event = ... \n variables = ... \n rulebase = ..." with the text forms of the three.
   std::string description() const;
 
  private:
   VariableStorePtr mVariables;
   RulebasePtr mRulebase;
+  std::shared_ptr<Keychain> mKeychain;
   std::optional<plist::Dictionary> mEvent;
   plist::Dictionary mEventMetadata;
   std::unique_ptr<StatContext> mStats;

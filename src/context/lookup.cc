@@ -31,10 +31,6 @@ plist::Dictionary* ScopeIn(VariableStore* store, std::string_view key) {
   return store->findDictionary(key);
 }
 
-std::string TextOrNull(const std::optional<plist::Value>& value) {
-  return value ? value->textForm() : "(null)";
-}
-
 }  // namespace
 
 std::optional<plist::Value> Context::variableValueForKey(std::string_view reference,
@@ -58,7 +54,8 @@ std::optional<plist::Value> Context::variableValueForKey(std::string_view refere
   } else if (name.starts_with(kEventPrefix)) {
     value = ValueIn(event(), name.substr(kEventPrefix.size()));
   } else if (name.starts_with(kKeychainPrefix)) {
-    if (auto password = ResolveKeychain(name.substr(kKeychainPrefix.size()))) {
+    if (!mKeychain) return std::nullopt;
+    if (auto password = ResolveKeychain(*mKeychain, name.substr(kKeychainPrefix.size()))) {
       value = plist::Value(std::move(*password));
     }
   } else if (name.starts_with(kGlobalPrefix)) {
@@ -72,12 +69,17 @@ std::optional<plist::Value> Context::variableValueForKey(std::string_view refere
   }
 
   if (suffix.empty()) return value;
-  return ApplyFormatSuffix(value, suffix);
+  std::optional<plist::Value> formatted = ApplyFormatSuffix(value, suffix);
+  // A secret read through a format suffix ("%d", "%x") is a secret in its new form too.
+  if (mKeychain && value && formatted && mKeychain->isSecret(*value)) {
+    mKeychain->rememberComputed(formatted->textForm());
+  }
+  return formatted;
 }
 
 bool Context::keyExists(std::string_view reference, std::string_view rulesFile) {
   const bool exists = variableValueForKey(reference, rulesFile).has_value();
-  const std::string shown(reference);
+  const std::string shown = shownText(reference);
   LogMessage(6, "KeyExists: %s %s in the datastore", shown.c_str(),
              exists ? "exists" : "does not exist");
   return exists;
@@ -94,38 +96,44 @@ void Context::setVariableValue(const std::optional<plist::Value>& value, std::st
   }
   if (!resolvedName || !resolvedName->isString()) {
     LogMessage(0, "The variable name %s is not a string. Skipping.",
-               TextOrNull(resolvedName).c_str());
+               shownValue(resolvedName).c_str());
     return;
   }
   std::string_view variable = resolvedName->string();
   const bool global = variable.starts_with(kGlobalPrefix);
   if (global) variable.remove_prefix(kGlobalPrefix.size());
   if (UnescapedColonsInString(variable)) {
-    const std::string shown(variable);
+    const std::string shown = shownText(variable);
     LogMessage(0, "Variable names cannot contain \":\" - skipping %s", shown.c_str());
     return;
   }
 
   std::optional<plist::Value> stored = value;
   if (value && value->isString()) {
-    LogMessage(4, "initial value = %s", value->string().c_str());
+    if (DebugLevel() >= 4) {
+      LogMessage(4, "initial value = %s", shownText(value->string()).c_str());
+    }
     stored = resolveVariablesInString(value->string(), rulesFile, &error);
     if (error) {
       LogMessage(0, "Error: %s", error->description.c_str());
       return;
     }
     if (DebugLevel() >= 4) {
-      LogMessage(4, "after resolveVarsInString value = %s", TextOrNull(stored).c_str());
+      LogMessage(4, "after resolveVarsInString value = %s", shownValue(stored).c_str());
     }
     // Purely arithmetic text becomes its number; the character test keeps ordinary text away
     // from the evaluator.
     if (stored && stored->isString() && IsArithmeticCandidate(stored->string())) {
       ArithmeticResult result = EvaluateArithmetic(stored->string());
       if (result.value) {
+        // The number computed from a secret is a secret too.
+        if (mKeychain && mKeychain->isSecret(*stored)) {
+          mKeychain->rememberComputed(result.value->textForm());
+        }
         stored = std::move(result.value);
       } else {
         LogMessage(4, "Exception thrown while evaluating expression: %s\n%s\n",
-                   stored->string().c_str(), result.failure.c_str());
+                   shownText(stored->string()).c_str(), shownText(result.failure).c_str());
       }
     }
   }
@@ -135,12 +143,13 @@ void Context::setVariableValue(const std::optional<plist::Value>& value, std::st
   if (global) {
     scope = ScopeIn(mVariables.get(), kGlobalsKey);
   } else if (rulesFile.empty()) {
-    LogMessage(1, "Cannot set file local variable %s because the file path is nil", key.c_str());
+    LogMessage(1, "Cannot set file local variable %s because the file path is nil",
+               shownText(key).c_str());
   } else {
     scope = ScopeIn(mVariables.get(), rulesFile);
   }
   // The text form is taken before the value moves into the store, and only when it is shown.
-  const std::string shown = DebugLevel() >= 3 ? TextOrNull(stored) : std::string();
+  const std::string shown = DebugLevel() >= 3 ? shownValue(stored) : std::string();
   if (scope != nullptr) {
     if (stored) {
       scope->set(key, std::move(*stored));
@@ -148,7 +157,9 @@ void Context::setVariableValue(const std::optional<plist::Value>& value, std::st
       scope->erase(key);
     }
   }
-  LogMessage(3, "  Set variable: %s = %s", key.c_str(), shown.c_str());
+  if (DebugLevel() >= 3) {
+    LogMessage(3, "  Set variable: %s = %s", shownText(key).c_str(), shown.c_str());
+  }
 }
 
 }  // namespace tarvod

@@ -128,15 +128,15 @@ std::optional<plist::Value> Context::resolveVariablesInString(const std::string&
     if (c == '}' && !escaped && openCount > 0) {
       const size_t start = open[--openCount];
       const std::string name = out.substr(start + 2);
-      LogMessage(4, "tokenName is %s", name.c_str());
+      if (DebugLevel() >= 4) LogMessage(4, "tokenName is %s", shownText(name).c_str());
       std::optional<plist::Value> value = variableValueForKey(name, rulesFile);
       // The whole text is this one reference: its value itself, of whatever kind, or nothing.
       if (start == 0 && i == n - 1) return value;
       out.resize(start);
       if (value) {
-        const std::string shown = value->textForm();
-        LogMessage(4, "tokenValue is %s", shown.c_str());
-        out += shown;
+        const std::string inserted = value->textForm();
+        if (DebugLevel() >= 4) LogMessage(4, "tokenValue is %s", shownText(inserted).c_str());
+        out += inserted;
       } else {
         LogMessage(4, "tokenValue is %s", "(null)");
         out.push_back('0');  // a variable without a value reads as 0 inside text
@@ -162,8 +162,10 @@ std::optional<plist::Value> Context::resolveVariablesInString(const std::string&
   }
   if (errors.empty()) return plist::Value(std::move(out));
 
-  std::string description = JoinLines(errors);
-  LogMessage(2, "Errors occurred resolving variables in string %s:\n%s", text.c_str(),
+  // The description is logged by every caller; a secret inserted before the failure must not
+  // travel in it.
+  std::string description = shownText(JoinLines(errors));
+  LogMessage(2, "Errors occurred resolving variables in string %s:\n%s", shownText(text).c_str(),
              description.c_str());
   if (error != nullptr) *error = SubstitutionError{.description = std::move(description)};
   return std::nullopt;
@@ -189,7 +191,7 @@ std::optional<plist::Value> Context::resolveVariablesInArray(const plist::Array&
     if (!value) {
       if (DebugLevel() >= 1) {
         LogMessage(1, "The array object %s could not be resolved and was omitted.",
-                   element.textForm().c_str());
+                   shownValue(element).c_str());
       }
       continue;
     }
@@ -218,7 +220,7 @@ std::optional<plist::Value> Context::resolveVariablesInDictionary(
   for (const auto& [key, value] : dictionary) {
     std::optional<plist::Value> resolvedValue = resolveVariablesInObject(value, rulesFile, slot);
     if (!resolvedValue) {
-      LogMessage(0, "The dictionary value %s could not be resolved", value.textForm().c_str());
+      LogMessage(0, "The dictionary value %s could not be resolved", shownValue(value).c_str());
     }
     if (*slot) {
       LogMessage(0, "Error: %s", (*slot)->description.c_str());
@@ -226,8 +228,8 @@ std::optional<plist::Value> Context::resolveVariablesInDictionary(
     }
     std::optional<plist::Value> resolvedKey = resolveVariablesInString(key, rulesFile, slot);
     if (!resolvedKey) {
-      std::string message =
-          FillPlaceholders(LocalizedString("The dictionary key %@ could not be resolved"), {key});
+      std::string message = FillPlaceholders(
+          LocalizedString("The dictionary key %@ could not be resolved"), {shownText(key)});
       LogMessage(0, "%s", message.c_str());
       *slot = SubstitutionError{.description = std::move(message)};
       return std::nullopt;

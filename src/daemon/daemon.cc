@@ -4,6 +4,7 @@
 #include <cstdio>
 
 #include "actions/log_action.h"
+#include "context/keychain.h"
 #include "daemon/configuration.h"
 #include "daemon/logs.h"
 #include "daemon/options.h"
@@ -80,6 +81,8 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   LogMessage(0, "Velkin Started %s", LocalDateText(mClock).c_str());
 
   mEngine = std::make_unique<Engine>(mClock, std::move(globals));
+  mEngine->setKeychain(std::make_shared<Keychain>(
+      ConfigurationString(mConfiguration, "keychainPath", kDefaultKeychainPath)));
   if (options->restoreState) {
     LogMessage(1, "Restoring saved state");
     RestoreState(mConfiguration, *mEngine, mFiles);

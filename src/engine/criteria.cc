@@ -204,14 +204,15 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
 
   const Value& first = operands[0];
   if (operands.size() == 1) {
-    LogMessage(2, "    Evaluating criteria: %s %s", first.textForm().c_str(), keyword.c_str());
+    LogMessage(2, "    Evaluating criteria: %s %s", context.shownValue(first).c_str(),
+               keyword.c_str());
   }
   // Only the first two operands are used; further ones are ignored.
   const Value* second = nullptr;
   if (*code < 16) {
     second = operands.size() > 1 ? &operands[1] : nullptr;
-    LogMessage(2, "    Evaluating criteria: %s %s %s", first.textForm().c_str(), keyword.c_str(),
-               second ? second->textForm().c_str() : "(null)");
+    LogMessage(2, "    Evaluating criteria: %s %s %s", context.shownValue(first).c_str(),
+               keyword.c_str(), second ? context.shownValue(*second).c_str() : "(null)");
   }
   return Decide(*code, first, second, context, filePath).value_or(false);
 }

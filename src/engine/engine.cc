@@ -36,9 +36,10 @@ std::vector<std::string_view> TypePrefixes(std::string_view type) {
 
 void QueuePrefix(SerialQueue& queue, double now, std::string_view prefix,
                  const RulebaseEntry& entry, const std::shared_ptr<const plist::Dictionary>& event,
-                 const RulebasePtr& rulebase, const VariableStorePtr& variables) {
+                 const RulebasePtr& rulebase, const VariableStorePtr& variables,
+                 const std::shared_ptr<Keychain>& keychain) {
   LogMessage(2, "  Processing event: %.*s", static_cast<int>(prefix.size()), prefix.data());
-  auto context = std::make_shared<Context>(variables, rulebase, *event);
+  auto context = std::make_shared<Context>(variables, rulebase, *event, keychain);
 
   // The counter runs in the rulebase entry, so "prefix:eventCounter" counts the events of
   // this prefix since the rules were loaded (a reload starts a new rulebase at 0); the
@@ -122,7 +123,7 @@ void Engine::dispatchEvent(const plist::Dictionary& event) {
     auto found = rulebase->find(prefix);
     if (found != rulebase->end()) {
       if (!shared) shared = std::make_shared<const plist::Dictionary>(event);
-      QueuePrefix(*mQueue, now, prefix, found->second, shared, rulebase, mVariables);
+      QueuePrefix(*mQueue, now, prefix, found->second, shared, rulebase, mVariables, mKeychain);
       continue;
     }
     if (prefix.size() == type.size()) WriteEventRecord(event, false, false);
@@ -149,8 +150,11 @@ RulebasePtr Engine::loadRules(const std::string& path, size_t* count) {
   auto rulebase = std::make_shared<Rulebase>();
   size_t loaded = 0;
   withVariables([&](VariableStore&) {
-    loaded = PathExtension(path).empty() ? LoadRulesDirectory(*rulebase, mVariables, path)
-                                         : LoadRulesFile(*rulebase, mVariables, path);
+    // A reload also picks up a store replaced with its old modification time.
+    if (mKeychain) mKeychain->forget();
+    loaded = PathExtension(path).empty()
+                 ? LoadRulesDirectory(*rulebase, mVariables, path, mKeychain)
+                 : LoadRulesFile(*rulebase, mVariables, path, mKeychain);
   });
   if (count) *count = loaded;
   return rulebase;

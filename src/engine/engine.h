@@ -16,6 +16,8 @@
 
 namespace tarvod {
 
+class Keychain;
+
 class Engine {
  public:
   // The store starts as { _globals = globals }; the rulebase starts empty.
@@ -55,12 +57,17 @@ class Engine {
 
   SerialQueue& queue() { return *mQueue; }
 
+  // The keychain store that every context reads "keychain:" references from; set once, before
+  // the first event and the first rules load. Loading rules makes it read the store again.
+  void setKeychain(std::shared_ptr<Keychain> keychain) { mKeychain = std::move(keychain); }
+
  private:
   plist::Dictionary daemonEvent(const char* type) const;
 
   const Clock& mClock;
   std::unique_ptr<SerialQueue> mQueue;
   VariableStorePtr mVariables;
+  std::shared_ptr<Keychain> mKeychain;  // used on the processing queue only
   std::atomic<RulebasePtr> mRulebase;
   RulebasePtr mPreviousRulebase;  // main thread only
   std::atomic<bool> mDispatchOpen{true};

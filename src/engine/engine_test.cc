@@ -1,15 +1,20 @@
 // The Engine: rules of events dispatched from several threads take turns on the processing
 // queue (were two ever to run at once, updates of the shared global would be lost and
 // ThreadSanitizer, which runs this test, would report it), a rulebase swapped during dispatch
-// is seen whole, and a drain that times out still lets the store be reached.
+// is seen whole, a drain that times out still lets the store be reached, and every context
+// reads the engine's keychain.
 
 #include "engine/engine.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <fstream>
 #include <thread>
 
+#include "context/keychain.h"
 #include "platform/structured_log.h"
 #include "platform/testing/fake_clock.h"
 #include "platform/testing/json_lines.h"
@@ -105,6 +110,41 @@ TEST_F(EngineTest, EventsAfterCloseDispatchReachNoRule) {
   EXPECT_EQ(engine_.drain(10), 0u);
   EXPECT_EQ(Count(engine_), 1);
   EXPECT_EQ(testing::ReadJsonRecords(records_).size(), 1u);
+}
+
+// Every context the engine makes reads the same keychain, on the processing queue; loading
+// rules (a reload) makes it read the store again even when its inode and time are unchanged.
+TEST_F(EngineTest, ContextsReadTheEnginesKeychainAndLoadingRulesRereadsIt) {
+  const std::string store = capture_.directory() + "/system.keychain";
+  auto writeStore = [&](const char* password) {
+    std::ofstream(store, std::ios::trunc)
+        << "<plist><array><dict><key>service</key><string>mail</string><key>account</key>"
+           "<string>relay</string><key>password</key><string>"
+        << password << "</string></dict></array></plist>";
+    chmod(store.c_str(), 0600);
+    const timespec times[2] = {{1, 0}, {1, 0}};
+    utimensat(AT_FDCWD, store.c_str(), times, 0);
+  };
+  writeStore("first");
+  engine_.setKeychain(std::make_shared<Keychain>(store));
+  auto rulebase = std::make_shared<Rulebase>();
+  (*rulebase)["tick"].rules = {
+      CountingRule("copy", {{"variables", Dictionary{{"global:pw", "${keychain:relay@mail}"}}}})};
+  engine_.swapRulebase(rulebase);
+  auto password = [&] {
+    engine_.dispatchEvent({{"eventType", "tick"}});
+    std::string found;
+    engine_.withVariables([&](VariableStore& variables) {
+      found = variables.findDictionary(kGlobalsKey)->find("pw")->string();
+    });
+    return found;
+  };
+  EXPECT_EQ(password(), "first");
+  writeStore("second");
+  EXPECT_EQ(password(), "first");
+  size_t count = 0;
+  engine_.loadRules(capture_.directory() + "/none.plist", &count);
+  EXPECT_EQ(password(), "second");
 }
 
 TEST_F(EngineTest, ADrainThatTimesOutDropsTheRestAndStillReachesTheStore) {

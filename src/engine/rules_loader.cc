@@ -20,11 +20,12 @@ std::string RuleName(const plist::Dictionary& rule) {
 
 // Assigns a rule's "eval on load" variables, keys in ascending order.
 void AssignLoadTimeVariables(const VariableStorePtr& variables, const std::string& variablesPath,
-                             const std::string& rulesFile) {
+                             const std::string& rulesFile,
+                             const std::shared_ptr<Keychain>& keychain) {
   LogMessage(3, "  preparing the \"eval on load\" vairables (from path %s)", variablesPath.c_str());
   if (std::optional<plist::Dictionary> loaded = LoadVariablesFile(variablesPath)) {
     // The rulebase is still being built: the context has none to show.
-    Context context(variables, nullptr);
+    Context context(variables, nullptr, keychain);
     for (const std::string& key : loaded->sortedKeys()) {
       context.setVariableValue(*loaded->find(key), key, rulesFile);
     }
@@ -43,8 +44,8 @@ std::optional<plist::Dictionary> LoadVariablesFile(const std::string& path) {
   return std::move(file->dictionary());
 }
 
-size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables,
-                     const std::string& path) {
+size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables, const std::string& path,
+                     const std::shared_ptr<Keychain>& keychain) {
   std::optional<plist::Value> file = plist::ReadPropertyListFile(path);
   if (!file || !file->isArray()) return 0;
   LogMessage(2, "LOADING RULES (%s)", path.c_str());
@@ -63,7 +64,7 @@ size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables,
     const plist::Array types = *eventTypes;
     source->set("filePath", plist::Value(path));
     if (const plist::Value* loadWith = source->find("loadVariablesWithRule")) {
-      AssignLoadTimeVariables(variables, loadWith->textForm(), path);
+      AssignLoadTimeVariables(variables, loadWith->textForm(), path, keychain);
     }
     auto rule = std::make_shared<const Rule>(std::move(*source));
     for (const plist::Value& type : types) {
@@ -84,7 +85,7 @@ size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables,
 }
 
 size_t LoadRulesDirectory(Rulebase& rulebase, const VariableStorePtr& variables,
-                          const std::string& path) {
+                          const std::string& path, const std::shared_ptr<Keychain>& keychain) {
   LogMessage(3, "Loading rules files from %s\n", path.c_str());
   // Entries are visited depth first, each directory's entries sorted by name, so that the
   // order rules run in does not depend on how the file system happens to list them.
@@ -112,7 +113,7 @@ size_t LoadRulesDirectory(Rulebase& rulebase, const VariableStorePtr& variables,
         subdirectories.push_back(entryPath);
         continue;
       }
-      total += LoadRulesFile(rulebase, variables, entryPath);
+      total += LoadRulesFile(rulebase, variables, entryPath, keychain);
     }
     // Pushed in reverse so the first subdirectory is walked first.
     for (auto it = subdirectories.rbegin(); it != subdirectories.rend(); ++it) {

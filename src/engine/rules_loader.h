@@ -4,6 +4,7 @@
 // is written by "eval on load" variables, so the Engine runs loading on its queue.
 #pragma once
 
+#include <memory>
 #include <optional>
 #include <string>
 
@@ -12,10 +13,14 @@
 
 namespace tarvod {
 
-size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables,
-                     const std::string& path);
+class Keychain;
+
+// keychain, when given, serves the "keychain:" references of load-time variables.
+size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables, const std::string& path,
+                     const std::shared_ptr<Keychain>& keychain = nullptr);
 size_t LoadRulesDirectory(Rulebase& rulebase, const VariableStorePtr& variables,
-                          const std::string& path);
+                          const std::string& path,
+                          const std::shared_ptr<Keychain>& keychain = nullptr);
 // A variables file's dictionary; nullopt (with its level-4 message) when it cannot be read.
 std::optional<plist::Dictionary> LoadVariablesFile(const std::string& path);
 
