@@ -4,6 +4,20 @@
 
 namespace tarvod {
 
+namespace {
+
+// The outer nullopt after logging the substitution's error; otherwise what it resolved to.
+std::optional<std::optional<plist::Value>> Checked(std::optional<plist::Value> resolved,
+                                                   const ErrorSlot& error) {
+  if (error) {
+    LogMessage(0, "Error: %s", error->description.c_str());
+    return std::nullopt;
+  }
+  return std::optional<std::optional<plist::Value>>(std::move(resolved));
+}
+
+}  // namespace
+
 std::optional<std::optional<std::string>> ResolveActionText(const plist::Dictionary& action,
                                                             std::string_view key,
                                                             const FiredRule& rule,
@@ -11,14 +25,21 @@ std::optional<std::optional<std::string>> ResolveActionText(const plist::Diction
   const plist::Value* value = action.find(key);
   if (value == nullptr) return std::optional<std::string>();
   ErrorSlot error;
-  std::optional<plist::Value> resolved =
-      context.resolveVariablesInString(value->textForm(), rule.filePath, &error);
-  if (error) {
-    LogMessage(0, "Error: %s", error->description.c_str());
-    return std::nullopt;
-  }
-  if (!resolved) return std::optional<std::string>();
-  return std::optional<std::string>(resolved->textForm());
+  const auto resolved =
+      Checked(context.resolveVariablesInString(value->textForm(), rule.filePath, &error), error);
+  if (!resolved) return std::nullopt;
+  if (!*resolved) return std::optional<std::string>();
+  return std::optional<std::string>((*resolved)->textForm());
+}
+
+std::optional<std::optional<plist::Value>> ResolveActionValue(const plist::Dictionary& action,
+                                                              std::string_view key,
+                                                              const FiredRule& rule,
+                                                              Context& context) {
+  const plist::Value* value = action.find(key);
+  if (value == nullptr) return std::optional<plist::Value>();
+  ErrorSlot error;
+  return Checked(context.resolveVariablesInObject(*value, rule.filePath, &error), error);
 }
 
 }  // namespace tarvod

@@ -34,4 +34,11 @@ std::optional<std::optional<std::string>> ResolveActionText(const plist::Diction
                                                             const FiredRule& rule,
                                                             Context& context);
 
+// action[key] resolved as a value of any kind (arrays and dictionaries element by element),
+// with the same outer nullopt on a failed substitution.
+std::optional<std::optional<plist::Value>> ResolveActionValue(const plist::Dictionary& action,
+                                                              std::string_view key,
+                                                              const FiredRule& rule,
+                                                              Context& context);
+
 }  // namespace tarvod

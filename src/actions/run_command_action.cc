@@ -56,23 +56,6 @@ std::string QuotedArguments(const plist::Array& arguments) {
   return quoted;
 }
 
-// A resolved value of any kind; the outer nullopt after a logged substitution error.
-std::optional<std::optional<plist::Value>> ResolveActionValue(const plist::Dictionary& action,
-                                                              std::string_view key,
-                                                              const FiredRule& rule,
-                                                              Context& context) {
-  const plist::Value* value = action.find(key);
-  if (value == nullptr) return std::optional<plist::Value>();
-  ErrorSlot error;
-  std::optional<plist::Value> resolved =
-      context.resolveVariablesInObject(*value, rule.filePath, &error);
-  if (error) {
-    LogMessage(0, "Error: %s", error->description.c_str());
-    return std::nullopt;
-  }
-  return resolved;
-}
-
 // The action's time limit in seconds (0: none); a value that is no number of seconds is
 // reported and the default applies.
 double TimeLimit(const std::optional<std::string>& text, double fallback) {
