@@ -314,21 +314,6 @@ TEST_F(SourcesTest, SharedPayloadsCannotExhaustTheDaemonsMemory) {
   close(connection.fd);
 }
 
-TEST_F(SourcesTest, ANonDictionaryMessageClosesItsConnection) {
-  startDaemon();
-  const SocketResult connection = ConnectSeqpacket(mSocketPath);
-  ASSERT_GE(connection.fd, 0);
-  std::string error;
-  ASSERT_TRUE(
-      SendPacket(connection.fd, PlistDocument("<array><string>a</string></array>"), &error));
-  char byte;
-  EXPECT_EQ(recv(connection.fd, &byte, 1, 0), 0) << "the daemon closed the connection";
-  EXPECT_TRUE(waitForLog("unexpected peer event: ")) << log();
-  close(connection.fd);
-  ASSERT_TRUE(SendAs(0, 0, mSocketPath, EventMessage("t", "next")));
-  EXPECT_TRUE(waitForEvent("next 0 0\n"));
-}
-
 TEST_F(SourcesTest, TheMissingAuditPipeIsReportedAndEventsStillArrive) {
   startDaemon();
   ASSERT_TRUE(waitForLog("Failed to open the Auditpipe error = 2\n")) << log();
@@ -336,29 +321,6 @@ TEST_F(SourcesTest, TheMissingAuditPipeIsReportedAndEventsStillArrive) {
   EXPECT_THAT(mDaemon->stderrText(), HasSubstr("failed to open the auditpipe: "));
   ASSERT_TRUE(SendAs(0, 0, mSocketPath, EventMessage("t", "socket")));
   EXPECT_TRUE(waitForEvent("socket 0 0\n"));
-}
-
-TEST_F(SourcesTest, APathHoldingAFileIsLeftAloneAndTheDaemonRunsOn) {
-  std::filesystem::create_directories(mSocketDirectory);
-  WriteFile(mSocketPath, "keep me");
-  startDaemon();
-  EXPECT_TRUE(waitForLog("XPC event listener failed to start up\n")) << log();
-  EXPECT_EQ(ReadFile(mSocketPath), "keep me");
-  EXPECT_TRUE(mDaemon->running());
-  EXPECT_EQ(mDaemon->stop(), 0);
-}
-
-TEST_F(SourcesTest, AStaleSocketFromAnEarlierRunIsReplaced) {
-  startDaemon();
-  ASSERT_EQ(mDaemon->stop(SIGKILL), 128 + SIGKILL);  // leaves the socket file behind
-  struct stat st;
-  ASSERT_EQ(lstat(mSocketPath.c_str(), &st), 0);
-  std::filesystem::remove(errorLog());  // so the restart is awaited on its own lines
-  startDaemon();
-  ASSERT_TRUE(SendAs(0, 0, mSocketPath, EventMessage("t", "again")));
-  EXPECT_TRUE(waitForEvent("again 0 0\n")) << log();
-  EXPECT_EQ(mDaemon->stop(), 0);
-  EXPECT_FALSE(FileExists(mSocketPath)) << "the socket file is removed at stop";
 }
 
 TEST_F(SourcesTest, TarvodctlSendsEventsFromArgumentsAndFromAPropertyListFile) {
