@@ -4,10 +4,12 @@
 #pragma once
 
 #include <cmath>
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "plist/codec.h"
 
@@ -51,6 +53,16 @@ inline void CheckTextRoundTrip(const plist::Value& value) {
   const std::optional<plist::Value> back = plist::ParseTextPropertyList(plist::Describe(value));
   if (!back) Fail("described text does not read back", value);
   if (!(*back == WholeSeconds(value))) Fail("described text reads back as another value", value);
+}
+
+// Reads bytes with the auto-detecting reader (XML or binary) and checks both round trips of
+// whatever it accepts.
+inline void CheckReadPropertyList(const uint8_t* data, size_t size) {
+  const std::string_view bytes(reinterpret_cast<const char*>(data), size);
+  if (const std::optional<plist::Value> value = plist::ReadPropertyList(bytes)) {
+    CheckXmlRoundTrip(*value);
+    CheckTextRoundTrip(*value);
+  }
 }
 
 }  // namespace tarvod::fuzz
