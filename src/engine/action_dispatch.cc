@@ -4,6 +4,7 @@
 
 #include "actions/debug_dump.h"
 #include "actions/log_action.h"
+#include "actions/post_notification.h"
 #include "engine/keyword_tables.h"
 #include "engine/rule_processor.h"
 #include "platform/diagnostic_log.h"
@@ -34,14 +35,17 @@ std::string LowerCase(std::string text) {
 }
 
 // The handler of an action code; nullptr for the keywords that do nothing in this build
-// (the mail, notification and command handlers come later, and sendmessage, sendqe, addtodb
-// and publishrss have none).
+// (the mail and command handlers come later, and sendmessage, sendqe, addtodb and publishrss
+// have none).
 Action* HandlerFor(long code) {
   static LogAction log;
   static DebugDumpAction debugDump;
+  static PostNotificationAction postNotification(NotificationCenter::Default());
   switch (code) {
     case kLog:
       return &log;
+    case kPostNotification:
+      return &postNotification;
     case kDebugDump:
       return &debugDump;
     default:
