@@ -350,7 +350,8 @@ std::string MatchRule(const std::string* object) {
 
 class BusNotificationCenter final : public NotificationCenter {
  public:
-  BusNotificationCenter() = default;
+  // The descriptor exists before any thread can post.
+  BusNotificationCenter() : mPostFd(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {}
   ~BusNotificationCenter() override {
     for (auto& [object, observation] : mObservations) sd_bus_slot_unref(observation.slot);
     sd_bus_slot_unref(mHoldSlot);
@@ -363,12 +364,10 @@ class BusNotificationCenter final : public NotificationCenter {
 
   Status attach(MainLoop& loop) override {
     if (!loop.event()) return Status::Error(ENXIO, "no main loop");
-    if (mPostFd < 0) {
-      mPostFd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-      if (mPostFd < 0 || sd_event_add_io(loop.event(), &mPostSource, mPostFd, EPOLLIN,
-                                         &BusNotificationCenter::OnPosts, this) < 0) {
-        return Status::Error(errno, "eventfd for posts");
-      }
+    if (!mPostSource &&
+        (mPostFd < 0 || sd_event_add_io(loop.event(), &mPostSource, mPostFd, EPOLLIN,
+                                        &BusNotificationCenter::OnPosts, this) < 0)) {
+      return Status::Error(EBADF, "no descriptor for posts");
     }
     if (mBus) return Status::Ok();
     Result<sd_bus*> bus = OpenSystemBus("tarvod-notifications");
@@ -532,7 +531,7 @@ class BusNotificationCenter final : public NotificationCenter {
   sd_bus_slot* mHoldSlot = nullptr;
   std::deque<Notification> mHeld;
 
-  int mPostFd = -1;
+  const int mPostFd;
   sd_event_source* mPostSource = nullptr;
   std::mutex mPostLock;
   std::deque<Notification> mPosts;  // guarded by mPostLock
