@@ -205,6 +205,33 @@ TEST_F(DaemonTest, SigtermAndSighupTogetherStopWithoutReloading) {
   EXPECT_THAT(ReadFile(errorLog()), Not(HasSubstr("Reloading Rules")));
 }
 
+// Interval timers on the real loop: a one-second timer fires every second, an entry whose
+// interval is 0 is refused, and after a reload there is still one timer per entry (two
+// would tick twice as fast).
+TEST_F(DaemonTest, PeriodicEventsTickOnTheirIntervalAndAReloadRecreatesThem) {
+  const std::string ticks = dir.file("ticks");
+  const std::string config = writeConfig(
+      {{"periodicEvents", Arr({Dict({{"eventType", Str("tick")}, {"startInterval", Int(1)}}),
+                               Dict({{"eventType", Str("zero")}, {"startInterval", Int(0)}}),
+                               Dict({{"startInterval", Int(1)}})})}});
+  const std::string rules = dir.write(
+      "rules.plist", RulesDocument({testing::RuleXml("tick", std::vector<std::string>{"tick"},
+                                                     {{"actions", Arr({FileLog("t", ticks)})}})}));
+  Daemon daemon({"-c", config, "-r", rules, "-v", "3"}, dir);
+  ASSERT_TRUE(daemon.waitForLine(ticks, "t\nt\n", 5s));
+  kill(daemon.pid(), SIGHUP);
+  ASSERT_TRUE(daemon.waitForLine(errorLog(), "EVENT RECEIVED: startup.reload"));
+  const auto reloaded = std::chrono::steady_clock::now();
+  const std::string after = ReadFile(ticks) + "t\nt\nt\n";
+  ASSERT_TRUE(daemon.waitForLine(ticks, after, 10s));
+  EXPECT_GE(std::chrono::steady_clock::now() - reloaded, 2400ms);
+  EXPECT_EQ(daemon.stop(), 0);
+  const std::string log = ReadFile(errorLog());
+  EXPECT_THAT(log, HasSubstr("entry 2 (zero) has startInterval 0, not a positive number"));
+  EXPECT_THAT(log, HasSubstr("2 Periodic Events configured"));
+  EXPECT_THAT(log, HasSubstr("Periodic Event received: {"));
+}
+
 // File-local variables survive a restart; the shutdown rules run before the state is saved
 // and "Velkin Shutdown at" is the last line.
 TEST_F(DaemonTest, StateIsSavedAtShutdownAndRestoredAtTheNextStart) {

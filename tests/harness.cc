@@ -233,6 +233,19 @@ bool Daemon::waitForLine(const std::string& file, std::string_view text,
   }
 }
 
+bool Daemon::waitForStartup(const std::string& errorLog, std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  for (;;) {
+    const std::string text = ReadFile(errorLog);
+    const size_t first = text.find("Registered ");
+    if (first != std::string::npos && text.find("Registered ", first + 1) != std::string::npos) {
+      return true;
+    }
+    if (!running() || std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(10ms);
+  }
+}
+
 int Daemon::stop(int signal, std::chrono::milliseconds timeout) {
   if (running()) kill(mPid, signal);
   return wait(timeout);

@@ -74,6 +74,9 @@ class Daemon {
   // without writing it.
   bool waitForLine(const std::string& file, std::string_view text,
                    std::chrono::milliseconds timeout = 15s);
+  // Waits until startup is over and the sources listen: startup logs "Registered %d events"
+  // once while it registers the notifications and once more after the sources started.
+  bool waitForStartup(const std::string& errorLog, std::chrono::milliseconds timeout = 15s);
   // Sends the signal and waits for the exit status (128 + signal when killed by one).
   int stop(int signal = SIGTERM, std::chrono::milliseconds timeout = 20s);
   // Waits for the daemon to exit by itself.

@@ -222,7 +222,7 @@ TEST_F(JournalTest, AStopEndsInTimeWhileARuleIsStuck) {
       "rules.plist", RulesDocument({RuleXml("count", {"tick", "shutdown", "startup"},
                                             {{"variables", Dict({{"n", Str("${n} + 1")}})}})}));
   Daemon daemon({"-c", config, "-r", rules, "-v", "1"}, dir);
-  ASSERT_TRUE(daemon.waitForLine(errorLog, "Registered"));
+  ASSERT_TRUE(daemon.waitForStartup(errorLog));
   for (int i = 0; i < 300; ++i) {
     RunProgram({TarvodctlBinary(), "send", "--socket", dir.file("evtq"), "tick"});
     if (ReadFile(errorLog).find("EVENT RECEIVED: tick") != std::string::npos && i > 50) break;
@@ -270,7 +270,7 @@ class SshJournalTest : public JournalTest {
                                       out)})}})}));
     daemon = std::make_unique<Daemon>(
         std::vector<std::string>{"-c", config, "-r", rules, "-v", "1", "-n"}, dir);
-    ASSERT_TRUE(daemon->waitForLine(errorLog, "Registered"));
+    ASSERT_TRUE(daemon->waitForStartup(errorLog));
   }
 
   std::unique_ptr<Daemon> daemon;

@@ -55,7 +55,7 @@ TEST(Load, EveryEventOfEightConcurrentSendersIsCountedInBoundedMemory) {
                            "<key>logPath</key>" + Str(counted) + "</dict></array></dict>";
   const std::string rules = dir.write("rules.plist", PlistDocument("<array>" + rule + "</array>"));
   Daemon daemon({"-c", config, "-r", rules, "-n", "-v", "1"}, dir);
-  ASSERT_TRUE(daemon.waitForLine(dir.file("error.log"), "Registered"));
+  ASSERT_TRUE(daemon.waitForStartup(dir.file("error.log")));
 
   std::atomic<int> failures{0};
   std::atomic<bool> sending{true};
@@ -122,7 +122,7 @@ TEST(Load, ReloadsUnderLoadLoseNoEventAndSwapInTheNewRules) {
   };
   writeRules(0);
   Daemon daemon({"-c", config, "-r", dir.file("rules"), "-n", "-v", "1"}, dir);
-  ASSERT_TRUE(daemon.waitForLine(dir.file("error.log"), "Registered"));
+  ASSERT_TRUE(daemon.waitForStartup(dir.file("error.log")));
 
   std::vector<std::string> failures(kSenders);
   std::vector<std::thread> senders;

@@ -1,19 +1,24 @@
-// tarvodctl: sends an event to a running tarvod over its event socket, and edits the keychain
-// store that "keychain:" references read.
+// tarvodctl: sends an event to a running tarvod over its event socket, posts a distributed
+// notification on the system bus, and edits the keychain store that "keychain:" references
+// read.
 //
 //   tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]
 //   tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE
+//   tarvodctl post NAME OBJECT [key=value ...]
+//   tarvodctl post --plist FILE NAME OBJECT
 //   tarvodctl [-c CONFIG] keychain [--keychain PATH] set SERVICE ACCOUNT
 //   tarvodctl [-c CONFIG] keychain [--keychain PATH] get|delete SERVICE ACCOUNT
 //   tarvodctl [-c CONFIG] keychain [--keychain PATH] list
 //
-// The first form sends { eventType = TYPE; eventDetails = { key = value; ... }; }, the second
+// send with TYPE sends { eventType = TYPE; eventDetails = { key = value; ... }; }, with --plist
 // the dictionary in a property-list file. Without --socket the path is the configuration
 // file's eventSocketPath (default configuration /etc/tarvod.d/tarvod.plist), else the
-// daemon's default. The keychain forms work on the configuration's keychainPath unless
-// --keychain names the store; they run only as root. set reads the password from standard
-// input (without echo on a terminal). Exit status: 0 done, 1 failed (not sent, no such item,
-// refused), 2 usage.
+// daemon's default. post posts the notification NAME with object OBJECT; its user information
+// is { eventType = OBJECT; eventDetails = { key = value; ... }; }, the event the daemon's rules
+// for OBJECT receive, or the dictionary in FILE. The keychain forms work on the
+// configuration's keychainPath unless --keychain names the store; they run only as root. set
+// reads the password from standard input (without echo on a terminal). Exit status: 0 done, 1
+// failed (not sent, no such item, refused), 2 usage.
 #include <termios.h>
 #include <unistd.h>
 
@@ -27,6 +32,7 @@
 
 #include "context/keychain.h"
 #include "platform/files.h"
+#include "platform/notification_center.h"
 #include "platform/secret_file.h"
 #include "platform/seqpacket.h"
 #include "plist/codec.h"
@@ -44,6 +50,8 @@ int Usage() {
   std::fprintf(stderr,
                "usage: tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]\n"
                "       tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE\n"
+               "       tarvodctl post NAME OBJECT [key=value ...]\n"
+               "       tarvodctl post --plist FILE NAME OBJECT\n"
                "       tarvodctl [-c CONFIG] keychain [--keychain PATH] set|get|delete SERVICE "
                "ACCOUNT\n"
                "       tarvodctl [-c CONFIG] keychain [--keychain PATH] list\n");
@@ -69,42 +77,40 @@ std::string ConfigurationPath(const std::string& configurationPath, std::string_
 }
 
 struct Command {
+  std::string verb;  // "send" or "post"
   std::string configurationPath = kDefaultConfiguration;
   std::optional<std::string> socketPath;
   std::optional<std::string> plistPath;
-  std::string type;
+  std::vector<std::string> names;  // send: TYPE; post: NAME OBJECT
   std::vector<std::string> pairs;
 };
 
 // Parses the command line; false on a usage error.
 bool Parse(const std::vector<std::string>& args, Command& command) {
-  size_t i = 0;
-  bool sawSend = false;
-  for (; i < args.size(); ++i) {
+  for (size_t i = 0; i < args.size(); ++i) {
     const std::string& arg = args[i];
     if ((arg == "-c" || arg == "--socket" || arg == "--plist") && i + 1 < args.size()) {
       const std::string& value = args[++i];
       if (arg == "-c") command.configurationPath = value;
       if (arg == "--socket") command.socketPath = value;
       if (arg == "--plist") command.plistPath = value;
-    } else if (arg == "-c" || arg == "--socket" || arg == "--plist") {
+    } else if (arg == "-c" || arg == "--socket" || arg == "--plist" || arg.starts_with("-")) {
       return false;
-    } else if (!sawSend) {
-      if (arg != "send") return false;
-      sawSend = true;
-    } else if (command.type.empty() && !command.plistPath && arg.find('=') == std::string::npos &&
-               !arg.starts_with("-")) {
-      command.type = arg;
-    } else if (!command.type.empty() && arg.find('=') != std::string::npos) {
+    } else if (command.verb.empty()) {
+      if (arg != "send" && arg != "post") return false;
+      command.verb = arg;
+    } else if (arg.find('=') == std::string::npos && command.pairs.empty()) {
+      command.names.push_back(arg);
+    } else if (arg.find('=') != std::string::npos && !command.plistPath) {
       command.pairs.push_back(arg);
     } else {
       return false;
     }
   }
-  if (!sawSend) return false;
-  // Exactly one of TYPE and --plist; pairs only with TYPE.
-  if (command.plistPath.has_value() == !command.type.empty()) return false;
-  return true;
+  // Pairs only without --plist; post: NAME OBJECT and no socket; send: TYPE or --plist.
+  if (command.plistPath && !command.pairs.empty()) return false;
+  if (command.verb == "post") return command.names.size() == 2 && !command.socketPath;
+  return command.verb == "send" && command.names.size() == (command.plistPath ? 0u : 1u);
 }
 
 struct KeychainCommand {
@@ -300,8 +306,15 @@ int main(int argc, char** argv) {
       const size_t equals = pair.find('=');
       details.set(pair.substr(0, equals), pair.substr(equals + 1));
     }
-    message.set("eventType", command.type);
+    message.set("eventType", command.names.back());
     message.set("eventDetails", std::move(details));
+  }
+
+  if (command.verb == "post") {
+    const tarvod::Status posted = tarvod::SendNotification(
+        tarvod::Notification{command.names[0], command.names[1], std::move(message)});
+    if (!posted.ok()) return Fail("the notification was not posted: " + posted.what());
+    return 0;
   }
 
   const std::optional<std::string> bytes = plist::WriteXmlPropertyList(message);

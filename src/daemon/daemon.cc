@@ -5,6 +5,7 @@
 
 #include "actions/log_action.h"
 #include "context/keychain.h"
+#include "daemon/companion_job.h"
 #include "daemon/configuration.h"
 #include "daemon/logs.h"
 #include "daemon/options.h"
@@ -17,6 +18,7 @@
 #include "platform/structured_log.h"
 #include "sources/event_listener.h"
 #include "sources/monitor_engine.h"
+#include "sources/notifications.h"
 
 namespace tarvod {
 namespace {
@@ -51,6 +53,7 @@ Daemon::Daemon(const Clock& clock, Files& files) : mClock(clock), mFiles(files) 
 
 Daemon::~Daemon() {
   // The sources go first: they dispatch into the engine until their thread is joined.
+  mRunningTimers.clear();
   mMonitor.reset();
   mEngine.reset();
 }
@@ -129,17 +132,23 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   mMonitor->setEventFilterUID(FilterList(mConfiguration, "filterByUID"),
                               FilterList(mConfiguration, "filterByGID"));
   mEngine->postStartupEvent(false);
+  mMainLoop = std::make_unique<MainLoop>();
+  mRunningTimers = CreatePeriodicEvents(mConfiguration, *mMonitor, *mMainLoop, mClock);
+  if (const Status attached = mCenter.attach(*mMainLoop); !attached.ok()) {
+    LogMessage(0, "Notifications are neither observed nor posted: %s", attached.what().c_str());
+  }
+  const int registered = RegisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
   mMonitor->beginListening();
-  LogMessage(1, "Registered %d events", 0);
+  LogMessage(1, "Registered %d events", registered);
+  EnableCompanionLogJob();
   NotifyServiceManager("READY=1");
   return std::nullopt;
 }
 
 void Daemon::runMainLoop() {
-  MainLoop loop;
-  loop.watch(SignalWakeDescriptor(), ClearSignalWake);
+  mMainLoop->watch(SignalWakeDescriptor(), ClearSignalWake);
   for (;;) {
-    const bool canRun = loop.runSlice(kSliceMicroseconds);
+    const bool canRun = mMainLoop->runSlice(kSliceMicroseconds);
     if (TakeStopRequest()) return;
     if (TakeReloadRequest()) {
       ReloadRules();
@@ -163,20 +172,29 @@ void Daemon::runMainLoop() {
 void Daemon::ReloadRules() {
   NotifyServiceManager("RELOADING=1");
   LogMessage(1, "Reloading Rules");
+  // Notifications posted from here on are held and delivered to the new observations.
+  mCenter.suspend();
   // New connections wait in the listen backlog; accepted ones and the audit source go on
   // delivering, against the old rulebase until the swap and the new one after it.
   mMonitor->suspend();
+  CancelPeriodicEvents(mRunningTimers);
+  UnregisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
   size_t ruleCount = 0;
   RulebasePtr rulebase = mEngine->loadRules(mRulesPath, &ruleCount);
   LogMessage(1, "Loaded %zu rules\n", ruleCount);
   mEngine->swapRulebase(std::move(rulebase));
   mEngine->postStartupEvent(true);
+  mRunningTimers = CreatePeriodicEvents(mConfiguration, *mMonitor, *mMainLoop, mClock);
   mMonitor->resume();
+  RegisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
+  mCenter.resume();
 }
 
 void Daemon::Shutdown() {
   NotifyServiceManager("STOPPING=1");
+  CancelPeriodicEvents(mRunningTimers);
   mEngine->postShutdownEvent();
+  UnregisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
   mMonitor->stopListening();
   mEngine->closeDispatch();
 
@@ -190,6 +208,9 @@ void Daemon::Shutdown() {
     LogMessage(0, "Shutdown: %zu rule jobs still pending after %lld seconds; stopping without them",
                pending, static_cast<long long>(timeout));
   }
+
+  // What the last rules posted leaves before the daemon does.
+  mCenter.flush(1.0);
 
   LogMessage(1, "Saving the global state...");
   SaveState(mConfiguration, *mEngine, mFiles);

@@ -10,8 +10,11 @@
 #include "engine/engine.h"
 #include "platform/clock.h"
 #include "platform/files.h"
+#include "platform/main_loop.h"
+#include "platform/notification_center.h"
 #include "plist/value.h"
 #include "sources/monitor.h"
+#include "sources/periodic_events.h"
 
 namespace tarvod {
 
@@ -41,6 +44,9 @@ class Daemon {
   std::string mRulesPath;
   std::unique_ptr<Engine> mEngine;
   std::unique_ptr<Monitor> mMonitor;
+  NotificationCenter& mCenter = NotificationCenter::Default();
+  std::unique_ptr<MainLoop> mMainLoop;
+  RunningTimers mRunningTimers;
 };
 
 // main: the process exit status.

@@ -4,6 +4,7 @@
 
 #include "actions/debug_dump.h"
 #include "actions/log_action.h"
+#include "actions/post_notification.h"
 #include "actions/run_command_action.h"
 #include "engine/keyword_tables.h"
 #include "engine/rule_processor.h"
@@ -40,16 +41,19 @@ RunCommandAction& RunCommandHandler() {
 }
 
 // The handler of an action code; nullptr for the keywords that do nothing in this build
-// (the mail and notification handlers come later, and sendmessage, sendqe, addtodb and
-// publishrss have none).
+// (the mail handlers come later, and sendmessage, sendqe, addtodb and publishrss have
+// none).
 Action* HandlerFor(long code) {
   static LogAction log;
   static DebugDumpAction debugDump;
+  static PostNotificationAction postNotification(NotificationCenter::Default());
   switch (code) {
     case kLog:
       return &log;
     case kRunCommand:
       return &RunCommandHandler();
+    case kPostNotification:
+      return &postNotification;
     case kDebugDump:
       return &debugDump;
     default:

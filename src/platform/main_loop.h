@@ -1,19 +1,23 @@
 // The main thread's run loop: an sd-event loop run in bounded slices, woken early by a
-// descriptor (the signal handlers' eventfd). Main thread only.
+// descriptor (the signal handlers' eventfd); it carries the periodic timers and the
+// notification bus connection. Main thread only.
 #pragma once
 
 #include <cstdint>
 #include <functional>
+#include <memory>
+
+#include "platform/timers.h"
 
 struct sd_event;
 struct sd_event_source;
 
 namespace tarvod {
 
-class MainLoop {
+class MainLoop final : public Timers {
  public:
   MainLoop();
-  ~MainLoop();
+  ~MainLoop() override;
   MainLoop(const MainLoop&) = delete;
   MainLoop& operator=(const MainLoop&) = delete;
 
@@ -22,6 +26,12 @@ class MainLoop {
   // Runs one slice: returns after handling what was ready or when microseconds have passed.
   // False when the loop cannot run at all (it then sleeps out the slice).
   bool runSlice(uint64_t microseconds);
+  // The sd-event loop, for sources attached by other platform units (the bus); nullptr when
+  // it could not be created.
+  sd_event* event() const { return mEvent; }
+
+  std::unique_ptr<TimerHandle> repeating(double period, std::function<void()> fire) override;
+  std::unique_ptr<TimerHandle> wallClock(double first, std::function<double()> fire) override;
 
  private:
   sd_event* mEvent = nullptr;

@@ -2,8 +2,8 @@
 // engine. It owns the input queue (a thread running its own event loop) on which the event
 // socket and the audit pipe deliver, and the sender filter.
 // Main thread: the constructor, setEventSocketPath, setEventFilterUID, beginListening,
-// stopListening, suspend, resume. Input queue: filterBySourceUID, applyBackPressure. Any
-// thread: processEvent.
+// stopListening, suspend, resume, processNotification, periodicEvent. Input queue:
+// filterBySourceUID, applyBackPressure. Any thread: processEvent.
 #pragma once
 
 #include <cstddef>
@@ -26,6 +26,7 @@ class IoSource;
 class PeerConnections;
 class SshJournalSource;
 class AuditReadSource;
+struct Notification;
 
 using IdSet = std::set<int64_t>;
 
@@ -92,6 +93,11 @@ class Monitor {
   // that ended it, or -1 when it could not start.
   int runAuditpipeListener();
   void processEvent(const plist::Dictionary& event);
+  // A notification observed for an event type (notifications.cc): its user information is
+  // the event, an absent one an empty event.
+  void processNotification(const Notification& notification);
+  // A periodic timer fired (periodic_events.cc).
+  void periodicEvent(const plist::Dictionary& event);
   bool filterBySourceUID(uint32_t uid, uint32_t gid) const;
   void resume();
   void suspend();
