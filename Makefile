@@ -64,7 +64,7 @@ run: build
 # crashes to build-fuzz/artifacts/. fuzz/TARGET.flags adds libFuzzer options for one target.
 FUZZ_SECONDS ?= 60
 FUZZ_TARGETS := plist_xml plist_binary plist_text context criteria bsm_record event_packet \
-  rules_file ssh_log
+  rules_file ssh_log keychain
 FUZZ_PACKAGES := clang libclang-rt-14-dev
 .PHONY: fuzz
 fuzz: deps
