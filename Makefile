@@ -9,9 +9,10 @@ CMAKE_FLAGS := -G Ninja -DCMAKE_BUILD_TYPE=$(BUILD_TYPE) -DTARVOD_WERROR=$(WERRO
 PACKAGES := build-essential cmake ninja-build pkg-config clang-format \
   libplist-dev libsystemd-dev libcurl4-openssl-dev \
   libgtest-dev libgmock-dev libbenchmark-dev \
-  dbus-daemon systemd util-linux procps bsd-mailx python3 python3-aiosmtpd
+  dbus-daemon systemd util-linux procps bsd-mailx python3 python3-aiosmtpd scdoc groff-base
 
-.PHONY: all deps build build-asan build-tsan test test-unit test-asan test-tsan run bench format clean
+.PHONY: all deps build build-asan build-tsan test test-unit test-asan test-tsan run bench format clean \
+  install uninstall
 
 all: build
 
@@ -79,6 +80,19 @@ fuzz: deps
 	    -artifact_prefix=build-fuzz/artifacts/$$t- $$(cat fuzz/$$t.flags 2>/dev/null) \
 	    build-fuzz/corpus/$$t fuzz/corpus/$$t || exit 1; \
 	done
+
+# Installs under DESTDIR$(PREFIX) (the unit and /etc below DESTDIR alone) through the build's
+# CMake install rules; an existing /etc/tarvod.d/tarvod.plist is kept.
+PREFIX ?= /usr
+install: build
+	DESTDIR=$(DESTDIR) cmake --install build --prefix $(PREFIX)
+
+# Removes what the last install with the same DESTDIR wrote (build/install_manifest.txt), except
+# the configuration and the rules below /etc/tarvod.d, which belong to the administrator.
+uninstall:
+	@test -f build/install_manifest.txt || { echo "nothing installed from build/"; exit 1; }
+	@grep -v '^/etc/tarvod.d/' build/install_manifest.txt | while read -r f; do \
+	  rm -fv "$(DESTDIR)$$f"; done
 
 format:
 	git ls-files '*.cc' '*.h' | xargs clang-format -i
