@@ -6,6 +6,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "context/context.h"
@@ -114,7 +115,7 @@ void Engine::dispatchEvent(const plist::Dictionary& event) {
   LogEvent(event);
   LogMessage(1, "EVENT RECEIVED: %s", type.c_str());
 
-  const RulebasePtr rulebase = mRulebase.load();
+  const RulebasePtr rulebase = this->rulebase();
   const double now = mClock.now();
   // One copy of the event, made when a prefix first has rules and shared by every record job
   // of this dispatch.
@@ -160,8 +161,20 @@ RulebasePtr Engine::loadRules(const std::string& path, size_t* count) {
   return rulebase;
 }
 
+RulebasePtr Engine::rulebase() const {
+  std::lock_guard<std::mutex> lock(mRulebaseLock);
+  return mRulebase;
+}
+
 void Engine::swapRulebase(RulebasePtr rulebase) {
-  mPreviousRulebase = mRulebase.exchange(std::move(rulebase));
+  RulebasePtr replaced;
+  {
+    std::lock_guard<std::mutex> lock(mRulebaseLock);
+    replaced = std::exchange(mRulebase, std::move(rulebase));
+  }
+  // The previous generation is released outside the lock: freeing a large rulebase must not
+  // hold up dispatching threads.
+  mPreviousRulebase = std::move(replaced);
 }
 
 bool Engine::withVariables(const std::function<void(VariableStore&)>& work) {

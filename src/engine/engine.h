@@ -7,6 +7,7 @@
 #include <atomic>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <string>
 
 #include "context/types.h"
@@ -37,7 +38,7 @@ class Engine {
   // store. *count receives the number of rules loaded.
   RulebasePtr loadRules(const std::string& path, size_t* count);
   // The rulebase events are dispatched against.
-  RulebasePtr rulebase() const { return mRulebase.load(); }
+  RulebasePtr rulebase() const;
   // One indivisible exchange: an event dispatched meanwhile sees the whole old rulebase or the
   // whole new one. The replaced rulebase stays alive as the previous one until the next swap.
   void swapRulebase(RulebasePtr rulebase);
@@ -68,7 +69,10 @@ class Engine {
   std::unique_ptr<SerialQueue> mQueue;
   VariableStorePtr mVariables;
   std::shared_ptr<Keychain> mKeychain;  // used on the processing queue only
-  std::atomic<RulebasePtr> mRulebase;
+  // Guards the reference only: readers copy it and let go at once. (A mutex rather than
+  // std::atomic<shared_ptr>, whose libstdc++ lock bit ThreadSanitizer cannot see.)
+  mutable std::mutex mRulebaseLock;
+  RulebasePtr mRulebase;
   RulebasePtr mPreviousRulebase;  // main thread only
   std::atomic<bool> mDispatchOpen{true};
   bool mAbandoned = false;

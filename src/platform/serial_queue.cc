@@ -102,9 +102,20 @@ bool SerialQueue::runExclusive(const std::function<void()>& work, double seconds
     work();
     return true;
   }
-  std::unique_lock<std::timed_mutex> jobLock(mJobLock, std::chrono::duration<double>(seconds));
-  if (!jobLock.owns_lock()) return false;
+  {
+    std::unique_lock<std::mutex> lock(mLock);
+    if (!mJobGate.wait_for(lock, std::chrono::duration<double>(seconds),
+                           [&] { return !mJobActive && !mExclusive; })) {
+      return false;
+    }
+    mExclusive = true;
+  }
   work();
+  {
+    std::lock_guard<std::mutex> lock(mLock);
+    mExclusive = false;
+  }
+  mJobGate.notify_all();
   return true;
 }
 
@@ -119,11 +130,19 @@ size_t SerialQueue::abandon() {
 }
 
 SerialQueue::BlockingSection::BlockingSection() : mQueue(tCurrentQueue) {
-  if (mQueue) mQueue->mJobLock.unlock();
+  if (!mQueue) return;
+  {
+    std::lock_guard<std::mutex> lock(mQueue->mLock);
+    mQueue->mJobActive = false;
+  }
+  mQueue->mJobGate.notify_all();
 }
 
 SerialQueue::BlockingSection::~BlockingSection() {
-  if (mQueue) mQueue->mJobLock.lock();
+  if (!mQueue) return;
+  std::unique_lock<std::mutex> lock(mQueue->mLock);
+  mQueue->mJobGate.wait(lock, [&] { return !mQueue->mExclusive; });
+  mQueue->mJobActive = true;
 }
 
 void SerialQueue::run() {
@@ -133,13 +152,14 @@ void SerialQueue::run() {
     if (mJobs.empty()) return;  // stopping, and everything submitted has run
     std::function<void()> job = std::move(mJobs.front());
     mJobs.pop_front();
+    mJobGate.wait(lock, [&] { return !mExclusive; });
+    mJobActive = true;
     lock.unlock();
-    {
-      std::lock_guard<std::timed_mutex> jobLock(mJobLock);
-      job();
-      job = nullptr;  // release what the job captured before reporting progress
-    }
+    job();
+    job = nullptr;  // release what the job captured before reporting progress
     lock.lock();
+    mJobActive = false;
+    mJobGate.notify_all();
     --mPending;
     if (mSignalArmed && mPending <= mSignalLimit) {
       mSignalArmed = false;

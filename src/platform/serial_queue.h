@@ -84,7 +84,12 @@ class SerialQueue {
   size_t mSignalLimit = 0;
   bool mSignalArmed = false;
   int mProgressFd = -1;
-  std::timed_mutex mJobLock;
+  // The job lock, kept under mLock with a condition variable rather than as a timed mutex
+  // (whose timed lock ThreadSanitizer cannot follow): a job holds it while it runs outside a
+  // blocking section; runExclusive holds it while its work runs.
+  std::condition_variable mJobGate;
+  bool mJobActive = false;
+  bool mExclusive = false;
   std::thread mThread;
 };
 
