@@ -71,18 +71,14 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
         LogMessage(0, "The value for %s is not a dictionary. Aborting log action.", "details");
         return;
       }
-      ErrorSlot error;
-      std::optional<plist::Value> resolved =
-          context.resolveVariablesInDictionary(details->dictionary(), rule.filePath, &error);
-      if (error) {
-        LogMessage(0, "Error: %s", error->description.c_str());
-        return;
-      }
-      if (resolved && resolved->isDictionary()) {
+      const std::optional<std::optional<plist::Value>> resolved =
+          ResolveActionValue(action, "details", rule, context);
+      if (!resolved) return;
+      if (*resolved && (*resolved)->isDictionary()) {
         // The details' keys are unique, so only the facility can share a name with one: the
         // later value replaces it in place, as in event records.
         const bool hasFacility = !attributes.empty();
-        for (const auto& [key, value] : resolved->dictionary()) {
+        for (const auto& [key, value] : (*resolved)->dictionary()) {
           if (hasFacility && key == attributes.front().first) {
             attributes.front().second = context.shownValue(value);
           } else {

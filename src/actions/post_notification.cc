@@ -29,14 +29,12 @@ void PostNotificationAction::perform(const plist::Dictionary& action, const Fire
       LogMessage(0, "DoNotificationAction: details is not a dictionary; nothing posted");
       return;
     }
-    ErrorSlot error;
-    std::optional<plist::Value> resolved =
-        context.resolveVariablesInDictionary(details->dictionary(), rule.filePath, &error);
-    if (error) {
-      LogMessage(0, "Error: %s", error->description.c_str());
-      return;
+    std::optional<std::optional<plist::Value>> resolved =
+        ResolveActionValue(action, "details", rule, context);
+    if (!resolved) return;
+    if (*resolved && (*resolved)->isDictionary()) {
+      resolvedDetails = std::move((*resolved)->dictionary());
     }
-    if (resolved && resolved->isDictionary()) resolvedDetails = std::move(resolved->dictionary());
   }
   // A notification needs a name to be posted under.
   if (!*name) {
