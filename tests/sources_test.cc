@@ -202,32 +202,6 @@ TEST_F(SourcesTest, ASendersOwnSenderUIDIsKept) {
   EXPECT_TRUE(waitForEvent("own chosen 3000\n")) << log();
 }
 
-TEST_F(SourcesTest, MessagesOnOneConnectionAreHandledInOrderAndSurviveMalformedOnes) {
-  startDaemon();
-  const SocketResult connection = ConnectSeqpacket(mSocketPath);
-  ASSERT_GE(connection.fd, 0) << connection.error;
-  std::string error;
-  for (const char* tag : {"one", "two", "three"}) {
-    ASSERT_TRUE(SendPacket(connection.fd, EventMessage("t", tag), &error)) << error;
-  }
-  ASSERT_TRUE(SendPacket(connection.fd, "not a property list", &error));
-  ASSERT_TRUE(SendPacket(connection.fd, EventMessage("t", "after"), &error));
-  // A dictionary without eventType is passed on and then ignored by the rule engine.
-  ASSERT_TRUE(SendPacket(connection.fd,
-                         PlistDocument("<dict><key>x</key><string>y</string></dict>"), &error));
-  ASSERT_TRUE(SendPacket(connection.fd, EventMessage("t", "last"), &error));
-  ASSERT_TRUE(waitForEvent("last 0 0\n")) << log();
-  EXPECT_EQ(ReadFile(eventsLog()), "one 0 0\ntwo 0 0\nthree 0 0\nafter 0 0\nlast 0 0\n");
-  // Rule processing writes its own lines from another thread, so the two lines of the
-  // malformed packet are checked in order rather than side by side.
-  const std::string text = log();
-  const size_t converted = text.find("_CFXPCCreateCFObjectFromXPCObject returned NULL\n");
-  ASSERT_NE(converted, std::string::npos);
-  EXPECT_NE(text.find("XPC Malformed event received from 0:0 (uid:gid)\n", converted),
-            std::string::npos);
-  close(connection.fd);
-}
-
 std::string BigEndian(uint64_t value, size_t size) {
   std::string out(size, '\0');
   for (size_t i = 0; i < size; ++i) out[size - 1 - i] = static_cast<char>(value >> (8 * i));
