@@ -3,8 +3,8 @@
 #include <gmock/gmock.h>
 #include <grp.h>
 #include <gtest/gtest.h>
-#include <poll.h>
 #include <plist/plist.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -108,16 +108,11 @@ struct FilterCase {
 };
 
 TEST_F(SourcesTest, TheSenderFilterDecidesWhichSendersReachARule) {
+  // The parsing of the lists is the monitor's unit test; here real senders' credentials go
+  // through the daemon's configuration.
   const std::vector<FilterCase> cases = {
-      {"a UID list",
-       "1001,1002",
-       nullptr,
-       {{1001, 3000, true}, {1002, 3000, true}, {1003, 3000, false}}},
-      {"a GID list", nullptr, "3001", {{1001, 3001, true}, {1001, 3002, false}, {0, 0, false}}},
       {"both lists", "1001", "3005", {{1001, 3000, true}, {1002, 3005, true}, {1002, 3000, false}}},
-      {"-1", "-1", nullptr, {{1001, 3000, false}, {0, 0, false}}},
-      {"a lone comma", ",", nullptr, {{0, 0, true}, {1001, 3000, false}}},
-      {"an empty string", "", nullptr, {{1001, 3000, true}, {0, 0, true}}},
+      {"no list", nullptr, nullptr, {{1003, 3003, true}}},
   };
   for (const FilterCase& c : cases) {
     SCOPED_TRACE(c.name);
