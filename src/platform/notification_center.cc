@@ -320,6 +320,8 @@ class Reader {
   std::string mError;
 };
 
+}  // namespace
+
 Result<Notification> ReadNotification(sd_bus_message* m) {
   const char* signature = sd_bus_message_get_signature(m, 1);
   const bool withUserInfo = signature && std::strcmp(signature, "ssa{sv}") == 0;
@@ -340,6 +342,8 @@ Result<Notification> ReadNotification(sd_bus_message* m) {
   }
   return notification;
 }
+
+namespace {
 
 std::string MatchRule(const std::string* object) {
   std::string rule = std::string("type='signal',path='") + kNotificationPath + "',interface='" +

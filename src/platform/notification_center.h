@@ -24,6 +24,8 @@
 #include "platform/status.h"
 #include "plist/value.h"
 
+typedef struct sd_bus_message sd_bus_message;
+
 namespace tarvod {
 
 class MainLoop;
@@ -79,6 +81,10 @@ class NotificationCenter {
   // A center of its own on the system bus (tests).
   static std::unique_ptr<NotificationCenter> Create();
 };
+
+// The arguments of a received Notification signal, bounded as above; an error says why the
+// message is refused.
+Result<Notification> ReadNotification(sd_bus_message* m);
 
 // Sends one notification on a connection of its own to the system bus and waits until the
 // bus has taken it (for tools; the daemon posts through its center).
