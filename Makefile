@@ -62,10 +62,11 @@ run: build
 
 # Fuzzing (fuzz/): each target built with clang, libFuzzer, ASan and UBSan in build-fuzz, then
 # run for FUZZ_SECONDS over its committed seeds; inputs it finds go to build-fuzz/corpus/TARGET,
-# crashes to build-fuzz/artifacts/. fuzz/TARGET.flags adds libFuzzer options for one target.
+# crashes to build-fuzz/artifacts/. fuzz/TARGET.flags adds libFuzzer options for one target and
+# fuzz/TARGET.dict is its dictionary of tokens.
 FUZZ_SECONDS ?= 60
 FUZZ_TARGETS := plist_xml plist_binary plist_text context criteria bsm_record event_packet \
-  rules_file ssh_log keychain
+  rules_file ssh_log keychain state_file dbus_notification
 FUZZ_PACKAGES := clang libclang-rt-14-dev
 .PHONY: fuzz
 fuzz: deps
@@ -78,6 +79,7 @@ fuzz: deps
 	  echo "fuzzing $$t for $(FUZZ_SECONDS) s"; mkdir -p build-fuzz/corpus/$$t; \
 	  ./build-fuzz/fuzz/$${t}_fuzz -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
 	    -artifact_prefix=build-fuzz/artifacts/$$t- $$(cat fuzz/$$t.flags 2>/dev/null) \
+	    $$(test -f fuzz/$$t.dict && echo -dict=fuzz/$$t.dict) \
 	    build-fuzz/corpus/$$t fuzz/corpus/$$t || exit 1; \
 	done
 
