@@ -205,6 +205,25 @@ TEST_F(DaemonTest, SigtermAndSighupTogetherStopWithoutReloading) {
   EXPECT_THAT(ReadFile(errorLog()), Not(HasSubstr("Reloading Rules")));
 }
 
+// logrotate moves the logs away and reloads: the error and event logs are written again by
+// their names, and nothing more goes to the moved files.
+TEST_F(DaemonTest, AReloadReopensRotatedLogs) {
+  const std::string events = dir.file("events.log");
+  const std::string config = writeConfig({{"logEvents", Int(1)}, {"eventLogPath", Str(events)}});
+  Daemon daemon({"-c", config, "-r", writeOneRule(), "-v", "1"}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+  ASSERT_TRUE(daemon.waitForLine(events, "startup.load"));
+  ASSERT_EQ(std::rename(errorLog().c_str(), (errorLog() + ".1").c_str()), 0);
+  ASSERT_EQ(std::rename(events.c_str(), (events + ".1").c_str()), 0);
+  kill(daemon.pid(), SIGHUP);
+  EXPECT_TRUE(daemon.waitForLine(errorLog(), "Reloading Rules"));
+  EXPECT_TRUE(daemon.waitForLine(events, "startup.reload"));
+  EXPECT_EQ(daemon.stop(), 0);
+  EXPECT_THAT(ReadFile(errorLog() + ".1"), Not(HasSubstr("Reloading Rules")));
+  EXPECT_THAT(ReadFile(events + ".1"), Not(HasSubstr("startup.reload")));
+  EXPECT_THAT(ReadFile(errorLog()), HasSubstr("Velkin Shutdown at"));
+}
+
 // Interval timers on the real loop: a one-second timer fires every second, an entry whose
 // interval is 0 is refused, and after a reload there is still one timer per entry (two
 // would tick twice as fast).

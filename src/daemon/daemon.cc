@@ -171,6 +171,8 @@ void Daemon::runMainLoop() {
 
 void Daemon::ReloadRules() {
   NotifyServiceManager("RELOADING=1");
+  // logrotate moves the logs away and asks for a reload: from here on they are new files.
+  ReopenLogs(mConfiguration);
   LogMessage(1, "Reloading Rules");
   // Notifications posted from here on are held and delivered to the new observations.
   mCenter.suspend();

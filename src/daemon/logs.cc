@@ -66,4 +66,21 @@ int SetUpLogs(const plist::Dictionary& configuration) {
   return 0;
 }
 
+void ReopenLogs(const plist::Dictionary& configuration) {
+  const auto reopen = [](const std::string* path, void (*attach)(int)) {
+    if (path == nullptr) return;
+    const int fd = SafeOpen(path->c_str(), 0600, O_WRONLY | O_APPEND);
+    if (fd < 0) {
+      LogMessage(0, "Cannot reopen %s (errno = %d); still writing to the file open before",
+                 path->c_str(), errno);
+      return;
+    }
+    attach(fd);
+  };
+  reopen(configuration.findString("errorLogPath"), AttachErrorLog);
+  if (ConfigurationInteger(configuration, "logEvents") != 0) {
+    reopen(configuration.findString("eventLogPath"), AttachEventLog);
+  }
+}
+
 }  // namespace tarvod

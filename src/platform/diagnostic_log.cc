@@ -224,6 +224,13 @@ void AttachErrorLog(int fd) {
 
 void AttachEventLog(int fd) {
   lseek(fd, 0, SEEK_END);
+  // Writers read the descriptor without a lock: a reopen moves the new file onto the number
+  // already in use, in one step, so that a writer never meets a closed or reused number.
+  const int current = gEventLogFd.load();
+  if (current >= 0 && dup3(fd, current, O_CLOEXEC) >= 0) {
+    close(fd);
+    return;
+  }
   const int old = gEventLogFd.exchange(fd);
   if (old >= 0) close(old);
 }
