@@ -51,4 +51,6 @@ install(CODE "
   endif()
 ")
 
-add_test(NAME install_layout COMMAND ${CMAKE_SOURCE_DIR}/tests/install_test.sh ${CMAKE_BINARY_DIR})
+if(TARVOD_TESTS)
+  add_test(NAME install_layout COMMAND ${CMAKE_SOURCE_DIR}/tests/install_test.sh ${CMAKE_BINARY_DIR})
+endif()

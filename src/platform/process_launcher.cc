@@ -96,7 +96,7 @@ TARVOD_CHILD_CODE void WriteChildMessage(int logFd, const MessageText& message, 
   }
 }
 
-TARVOD_CHILD_CODE [[noreturn]] void FailChild(const ChildPlan& plan, const MessageText& message,
+[[noreturn]] TARVOD_CHILD_CODE void FailChild(const ChildPlan& plan, const MessageText& message,
                                               int error, int status) {
   WriteChildMessage(plan.logFd, message, error);
   _exit(status);
