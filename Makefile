@@ -11,8 +11,8 @@ PACKAGES := build-essential cmake ninja-build pkg-config clang-format \
   libgtest-dev libgmock-dev libbenchmark-dev \
   dbus-daemon systemd util-linux procps bsd-mailx python3 python3-aiosmtpd scdoc groff-base
 
-.PHONY: all deps build build-asan build-tsan test test-unit test-asan test-tsan run bench format clean \
-  install uninstall
+.PHONY: all deps build build-asan build-tsan test test-unit test-asan test-tsan test-deb run bench \
+  format clean install uninstall deb
 
 all: build
 
@@ -50,7 +50,7 @@ test-tsan: build-tsan
 	TSAN_OPTIONS=halt_on_error=1:second_deadlock_stack=1 \
 	  ctest --test-dir build-tsan --output-on-failure -j $(JOBS) -L threaded
 
-test: test-unit test-asan test-tsan
+test: test-unit test-asan test-tsan test-deb
 
 bench: build
 	@for b in build/bench/*_bench; do [ -x "$$b" ] && "$$b"; done
@@ -96,8 +96,23 @@ uninstall:
 	@grep -v '^/etc/tarvod.d/' build/install_manifest.txt | while read -r f; do \
 	  rm -fv "$(DESTDIR)$$f"; done
 
+# The Debian package, built from a copy of this tree's files (committed and new, not ignored)
+# so that dpkg-buildpackage writes its results into build-deb/ and nowhere beside the checkout;
+# then lintian, which fails the target on any error.
+DEB_PACKAGES := debhelper dpkg-dev fakeroot lintian
+deb:
+	@$(MAKE) --no-print-directory deps PACKAGES="$(DEB_PACKAGES)"
+	rm -rf build-deb && mkdir -p build-deb/tarvod
+	git ls-files -co --exclude-standard | while read -r f; do [ -e "$$f" ] && echo "$$f"; done | \
+	  tar -cf - -T - | tar -xf - -C build-deb/tarvod
+	cd build-deb/tarvod && DEB_BUILD_OPTIONS="nocheck parallel=$(JOBS)" dpkg-buildpackage -us -uc -b
+	lintian --fail-on error build-deb/*.changes
+
+test-deb: deb
+	tests/package_test.sh build-deb
+
 format:
 	git ls-files '*.cc' '*.h' | xargs clang-format -i
 
 clean:
-	rm -rf build build-asan build-tsan run
+	rm -rf build build-asan build-tsan build-deb build-fuzz run

@@ -19,16 +19,7 @@ fail() { echo "FAIL: $*" >&2; exit 1; }
 
 DESTDIR=$tmp/root cmake --install "$build" --prefix /usr >"$tmp/log" || { cat "$tmp/log"; fail "install"; }
 
-expected=(
-  /etc/logrotate.d/tarvod
-  /etc/tarvod.d/rules/
-  /etc/tarvod.d/tarvod.plist
-  /lib/systemd/system/tarvod.service
-  /usr/bin/tarvodctl
-  /usr/sbin/tarvod
-  /usr/share/bash-completion/completions/tarvodctl
-  /usr/share/dbus-1/system.d/com.quenta.DistributedNotifications.conf
-)
+mapfile -t expected < <(grep -v '^#' "$(dirname "$0")/installed_files")
 pages=(man5/tarvod-rules.5 man5/tarvod.plist.5 man8/tarvod.8 man8/tarvodctl.8)
 if command -v scdoc >/dev/null; then
   for p in "${pages[@]}"; do expected+=("/usr/share/man/$p"); done
