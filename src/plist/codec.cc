@@ -643,7 +643,9 @@ std::optional<std::string> StringOfNode(plist_t node) {
   const char* text = plist_get_string_ptr(node, &length);
   if (!text) return std::string();
   std::string s(text, length);
-  if (!IsValidUtf8(s)) return std::nullopt;
+  // A NUL written into XML text as a raw byte: refused as the binary reader refuses it, since
+  // no writer could write the string again (a saved state holding one could not be saved).
+  if (s.find('\0') != std::string::npos || !IsValidUtf8(s)) return std::nullopt;
   return s;
 }
 

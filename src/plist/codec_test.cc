@@ -285,7 +285,7 @@ TEST(PropertyListHostile, EveryTruncationReadsAsNoValue) {
   }
 }
 
-TEST(PropertyListHostile, InvalidUtf8ReadsAsNoValue) {
+TEST(PropertyListHostile, InvalidUtf8AndNulReadAsNoValue) {
   const std::string cases[] = {
       "<plist><string>\xC3\x28</string></plist>",
       "<plist><dict><key>\xED\xA0\x80</key><true/></dict></plist>",
@@ -298,6 +298,7 @@ TEST(PropertyListHostile, InvalidUtf8ReadsAsNoValue) {
       BinaryList({"\x53"
                   "a\0b"s}),  // NUL that libplist would cut the string at
       BinaryList({"\x61\x00\x00"s}),
+      "<plist><string>a\0b</string></plist>"s,  // a raw NUL no writer could write again
   };
   for (const std::string& bytes : cases) EXPECT_FALSE(ReadPropertyList(bytes)) << bytes;
 }
