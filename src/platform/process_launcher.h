@@ -59,6 +59,13 @@ struct LaunchRequest {
   // Written when entering workingDirectory fails, which then ends the child with the error
   // number as status; an empty text means the failure is ignored.
   ChildMessage chdirFailure;
+  // Written when executing program fails; the child then ends with the error number.
+  ChildMessage execFailure;
+  // When set, standard input is a new pipe in place of redirections[0]: launch writes this
+  // text to it and closes it before it returns, spending at most inputSeconds on the writing
+  // (0: no limit). A program that ends or closes its input early leaves the rest unwritten.
+  std::optional<std::string> input;
+  double inputSeconds = 0;
 };
 
 // A started child. The pidfd is the caller's until a wait reports the child's end or
@@ -66,6 +73,10 @@ struct LaunchRequest {
 struct ChildProcess {
   pid_t pid = -1;
   int pidfd = -1;
+  // How the writing of LaunchRequest::input went: EPIPE when the program closed its input
+  // early, ETIMEDOUT when inputSeconds passed first; inputWritten bytes reached the pipe.
+  Status input = Status::Ok();
+  size_t inputWritten = 0;
 };
 
 // The status of an ended child: its exit status, or 128 + the signal that ended it.
