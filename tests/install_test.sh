@@ -25,6 +25,7 @@ expected=(
   /etc/tarvod.d/tarvod.plist
   /lib/systemd/system/tarvod.service
   /usr/bin/tarvodctl
+  /usr/libexec/tarvod/femail
   /usr/sbin/tarvod
   /usr/share/bash-completion/completions/tarvodctl
   /usr/share/dbus-1/system.d/com.quenta.DistributedNotifications.conf
@@ -41,7 +42,7 @@ actual=$(cd "$tmp/root" && find . \( -type f -o -type l -o -type d -empty \) |
 want=$(printf '%s\n' "${expected[@]}" | sort)
 diff <(echo "$want") <(echo "$actual") || fail "installed files differ (- expected, + installed)"
 
-for b in usr/sbin/tarvod usr/bin/tarvodctl; do [ -x "$tmp/root/$b" ] || fail "$b not executable"; done
+for b in usr/sbin/tarvod usr/bin/tarvodctl usr/libexec/tarvod/femail; do [ -x "$tmp/root/$b" ] || fail "$b not executable"; done
 grep -qx 'ExecStart=/usr/sbin/tarvod' "$tmp/root/lib/systemd/system/tarvod.service" || fail "unit ExecStart"
 bash -n "$tmp/root/usr/share/bash-completion/completions/tarvodctl" || fail "completion syntax"
 
