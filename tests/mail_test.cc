@@ -266,6 +266,41 @@ TEST_F(MailTest, RelayModeDeliversEachLanguageThroughFemailToAnSmtpServer) {
   EXPECT_THAT(log, HasSubstr("exited with status 1"));
 }
 
+TEST_F(MailTest, FemailTakesItsEnvelopeFromTheHeaderBlockOnly) {
+  SmtpServer server(dir);
+  ASSERT_FALSE(server.address().empty()) << "aiosmtpd did not start";
+  const auto femail = [](const std::string& relay, const std::string& input) {
+    return RunProgram({"/usr/bin/env", "-i", "SMTPHOST=" + relay, FEMAIL_BINARY_PATH, "-t"}, input);
+  };
+  const RunResult sent = femail(server.address(),
+                                "To: \"Doe, J\" <j@x.com>,\n k@x.com\n"
+                                "cc: =?UTF-8?Q?L=C3=A9a?= <l@x.com>\r\n"
+                                "From: Admin <adm@x.com>\n"
+                                "\n"
+                                "To: m@x.com\n");
+  EXPECT_EQ(sent.status, 0) << sent.err;
+  const auto mails = server.mails();
+  ASSERT_EQ(mails.count("j@x.com"), 1u);
+  EXPECT_THAT(mails.at("j@x.com").recipients,
+              UnorderedElementsAre("j@x.com", "k@x.com", "l@x.com"));
+  EXPECT_EQ(mails.at("j@x.com").from, "adm@x.com");
+
+  const struct {
+    std::string relay;
+    int status;
+    std::string message;
+  } failures[] = {
+      {"127.0.0.1:1", 1, "femail: the relay did not take the mail: smtp://127.0.0.1:1"},
+      {server.address(), 1, "(reply 550)"},
+      {"relay/x", 2, "femail: SMTPHOST is not a host or host:port"},
+  };
+  for (const auto& failure : failures) {
+    const RunResult result = femail(failure.relay, "To: a@refused.example\n\nm");
+    EXPECT_EQ(result.status, failure.status);
+    EXPECT_THAT(result.err, HasSubstr(failure.message));
+  }
+}
+
 TEST_F(MailTest, LocalModeGivesTheMailProgramItsOptionsAndTheMessage) {
   std::filesystem::create_directories(dir.file("rec"));
   const std::string program = dir.write("mail", Recorder(dir.file("rec")));
