@@ -322,13 +322,13 @@ int SendEmailAction::send(const plist::Dictionary& action, const FiredRule& rule
       mail.cc = found->second;
     mail.sender = sender;
     mail.relayHost = relayHost;
-    const int status = submit(std::move(mail));
+    const int status = submit(std::move(mail), context);
     if (status != 0) result = status;
   }
   return result;
 }
 
-int SendEmailAction::submit(Mail mail) {
+int SendEmailAction::submit(Mail mail, const Context& context) {
   const bool relay = !mail.relayHost.empty();
   mail.to = SafeAddresses(RemoveRepeatedAddresses(mail.to), !relay);
   mail.cc = SafeAddresses(RemoveRepeatedAddresses(mail.cc), !relay);
@@ -374,16 +374,17 @@ int SendEmailAction::submit(Mail mail) {
     arguments.push_back(Joined(to, ","));
   }
 
+  // A value from the keychain may be anywhere in these: the traces show it masked.
   if (DebugLevel() > 3) {
-    LogMessage(4, "    Recipients: %s", Joined(to, ", ").c_str());
-    LogMessage(4, "    CC'd Recipients: %s", Joined(cc, ", ").c_str());
-    LogMessage(4, "    Relay Host: %s", mail.relayHost.c_str());
-    LogMessage(4, "    Admin EMail: %s", mail.sender.c_str());
-    LogMessage(4, "    Headers: %s", headers.c_str());
+    LogMessage(4, "    Recipients: %s", context.shownText(Joined(to, ", ")).c_str());
+    LogMessage(4, "    CC'd Recipients: %s", context.shownText(Joined(cc, ", ")).c_str());
+    LogMessage(4, "    Relay Host: %s", context.shownText(mail.relayHost).c_str());
+    LogMessage(4, "    Admin EMail: %s", context.shownText(mail.sender).c_str());
+    LogMessage(4, "    Headers: %s", context.shownText(headers).c_str());
   }
   if (DebugLevel() >= 5) {
     LogMessage(5, "    Mail command:\n      %s %s", request.program.c_str(),
-               Quoted(arguments).c_str());
+               context.shownText(Quoted(arguments)).c_str());
   }
 
   request.arguments.push_back(request.program);

@@ -48,7 +48,8 @@ class SendEmailAction final : public Action {
     std::string message;
     std::string relayHost;
   };
-  int submit(Mail mail);
+  // context only shows the traces with keychain passwords masked.
+  int submit(Mail mail, const Context& context);
 
   ProcessLauncher& mLauncher;
   const bool mShortMessage;

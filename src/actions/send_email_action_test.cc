@@ -106,6 +106,7 @@ class SendEmailTest : public ::testing::Test {
 };
 
 TEST_F(SendEmailTest, RelayModeWritesTheHeaderBlockAnEmptyLineAndTheMessage) {
+  SetDebugLevel(5);
   EXPECT_EQ(
       Send(Dictionary{{"recipientAddresses", Array{Value("a@x.com, b@x.com"), Value("a@x.com")}},
                       {"ccAddresses", "Ren\xC3\xA9 <r@x.com>"},
@@ -128,6 +129,12 @@ TEST_F(SendEmailTest, RelayModeWritesTheHeaderBlockAnEmptyLineAndTheMessage) {
             "To: injected@x.com\nbody a:b");
   EXPECT_EQ(request.redirections[1].descriptor, 1);
   EXPECT_EQ(request.redirections[2].descriptor, 2);
+  EXPECT_TRUE(testing::LinesInOrder(
+      capture_.text(), {"    Recipients: a@x.com, b@x.com\n",
+                        "    CC'd Recipients: =?UTF-8?Q?Ren=C3=A9_?=<r@x.com>\n",
+                        "    Relay Host: smtp.x.com:587\n", "    Admin EMail: root@x.com\n",
+                        "    Headers: To: ", "    Mail command:\n      /bin/femail \"-t\"\n"}))
+      << capture_.text();
 }
 
 TEST_F(SendEmailTest, LocalModePassesSubjectCcAndToOnTheCommandLine) {
