@@ -18,7 +18,6 @@ using plist::Value;
 using ::testing::ElementsAre;
 using ::testing::ElementsAreArray;
 using ::testing::HasSubstr;
-using ::testing::Not;
 
 constexpr const char* kRulesFile = "/rules/mail.plist";
 
@@ -137,39 +136,6 @@ TEST_F(SendEmailTest, RelayModeWritesTheHeaderBlockAnEmptyLineAndTheMessage) {
       << capture_.text();
 }
 
-TEST_F(SendEmailTest, LocalModePassesSubjectCcAndToOnTheCommandLine) {
-  const struct Case {
-    Dictionary action;
-    std::vector<std::string> arguments;
-  } cases[] = {
-      {Dictionary{{"recipientAddresses", "a@x.com,b@x.com"}, {"subject", "Alert"}},
-       {"-E", "-n", "-s", "Alert", "a@x.com,b@x.com"}},
-      {Dictionary{{"ccAddresses", Array{Value("${global:pair}")}}, {"adminEmail", "r@x.com"}},
-       {"-E", "-n", "-c", "p1@x.com,p2@x.com", ""}},
-      {Dictionary{{"recipientAddresses", "a@x.com"}, {"subject", ""}},
-       {"-E", "-n", "-s", "", "a@x.com"}},
-  };
-  for (const Case& c : cases) {
-    launcher_.requests.clear();
-    Send(c.action);
-    ASSERT_EQ(launcher_.requests.size(), 1u);
-    EXPECT_EQ(launcher_.requests[0].program, "/bin/mail");
-    EXPECT_THAT(Arguments(0), ElementsAreArray(c.arguments));
-    EXPECT_FALSE(launcher_.requests[0].environment.has_value());
-    EXPECT_EQ(*launcher_.requests[0].input, "");
-  }
-}
-
-TEST_F(SendEmailTest, SendsOneMailPerLanguageWithItsOwnRecipients) {
-  Send(Dictionary{{"recipientAddresses", "fr:a@x.com, b@x.com, c@x.de"},
-                  {"ccAddresses", "fr\\:d@x.com"},
-                  {"message", "hello"}});
-  ASSERT_EQ(launcher_.requests.size(), 3u);  // de, en, fr
-  EXPECT_THAT(Arguments(0), ElementsAre("-E", "-n", "c@x.de"));
-  EXPECT_THAT(Arguments(1), ElementsAre("-E", "-n", "b@x.com"));
-  EXPECT_THAT(Arguments(2), ElementsAre("-E", "-n", "-c", "d@x.com", "a@x.com"));
-}
-
 TEST_F(SendEmailTest, RelayHostFallsBackToTheFileVariableThenTheGlobalOne) {
   const struct Case {
     std::optional<std::string> key, fileVariable, globalVariable;
@@ -241,21 +207,6 @@ TEST_F(SendEmailTest, FailuresAbortTheActionOrAreRemembered) {
   EXPECT_EQ(Send(Dictionary{{"recipientAddresses", "a@x.com"}}), 128 + 9);
   EXPECT_EQ(launcher_.terminations, 1);
   EXPECT_EQ(launcher_.requests.back().inputSeconds, 5);
-}
-
-TEST(SendShortMessage, HasNoSubjectAndACutBody) {
-  testing::LogCapture capture(0);
-  FakeProcessLauncher launcher;
-  SendEmailAction handler(launcher, true);
-  Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>());
-  const Dictionary rule;
-  handler.send(Dictionary{{"recipientAddresses", "a@x.com"},
-                          {"relayHost", "smtp.x.com"},
-                          {"subject", "ignored"},
-                          {"message", std::string(500, 'm')}},
-               FiredRule{rule, "sms", ""}, context);
-  ASSERT_EQ(launcher.requests.size(), 1u);
-  EXPECT_EQ(*launcher.requests[0].input, "To: a@x.com\n\n" + std::string(159, 'm') + "\n");
 }
 
 }  // namespace
