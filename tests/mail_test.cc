@@ -76,8 +76,9 @@ struct Mail {
   std::string body;  // line ends as LF
 };
 
+// The data's line ends are CRLF; anything else is kept, so that a stray CR shows.
 Mail ParseMail(std::string text) {
-  for (size_t at; (at = text.find("\r\n")) != std::string::npos;) text.erase(at, 1);
+  for (size_t at = 0; (at = text.find("\r\n", at)) != std::string::npos; ++at) text.erase(at, 1);
   Mail mail;
   const size_t envelopeEnd = text.find("\n\n");
   const size_t headersEnd = text.find("\n\n", envelopeEnd + 2);
@@ -276,14 +277,15 @@ TEST_F(MailTest, FemailTakesItsEnvelopeFromTheHeaderBlockOnly) {
                                 "To: \"Doe, J\" <j@x.com>,\n k@x.com\n"
                                 "cc: =?UTF-8?Q?L=C3=A9a?= <l@x.com>\r\n"
                                 "From: Admin <adm@x.com>\n"
-                                "\n"
-                                "To: m@x.com\n");
+                                "\r\n"
+                                "To: m@x.com\r\n");
   EXPECT_EQ(sent.status, 0) << sent.err;
   const auto mails = server.mails();
   ASSERT_EQ(mails.count("j@x.com"), 1u);
   EXPECT_THAT(mails.at("j@x.com").recipients,
               UnorderedElementsAre("j@x.com", "k@x.com", "l@x.com"));
   EXPECT_EQ(mails.at("j@x.com").from, "adm@x.com");
+  EXPECT_EQ(mails.at("j@x.com").body, "To: m@x.com\n");
 
   const struct {
     std::string relay;

@@ -163,6 +163,9 @@ int main(int argc, char** argv) {
     mail.append(buffer, static_cast<size_t>(count));
   }
 
+  // libcurl turns every LF into CRLF on the way out: a CRLF already there would gain a CR.
+  for (size_t at = 0; (at = mail.find("\r\n", at)) != std::string::npos;) mail.erase(at, 1);
+
   std::string sender;
   std::vector<std::string> recipients;
   for (const Header& header : ParseHeaders(mail)) {
