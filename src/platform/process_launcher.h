@@ -87,11 +87,12 @@ class ProcessLauncher {
   virtual ~ProcessLauncher() = default;
 
   // Starts the child in a process group of its own and returns once it has executed the
-  // program or ended. Before the program runs, the child: resets every signal to its default
-  // action with none blocked; changes identity; takes descriptor redirections; closes every
-  // descriptor from 3 up; opens path redirections; enters the working directory. A step that
-  // fails ends it: status 1 (identity, redirection), the error number (working directory,
-  // execution). Fails only when no child could be created.
+  // program or ended, and has taken its input when one is given (within the input's time
+  // limit; the writing never raises SIGPIPE). Before the program runs, the child: resets every
+  // signal to its default action with none blocked; changes identity; takes descriptor
+  // redirections; closes every descriptor from 3 up; opens path redirections; enters the working
+  // directory. A step that fails ends it: status 1 (identity, redirection), the error number
+  // (working directory, execution). Fails only when no child (or no input pipe) could be created.
   virtual Result<ChildProcess> launch(const LaunchRequest& request) = 0;
   // Waits for the child's end, at most seconds when given. nullopt: it still runs.
   virtual std::optional<ExitStatus> wait(ChildProcess& child, std::optional<double> seconds) = 0;
