@@ -25,7 +25,7 @@ endif()
 
 install(TARGETS tarvod DESTINATION sbin)
 install(TARGETS tarvodctl DESTINATION bin)
-# femail goes to libexec/tarvod once the mail action brings it.
+install(TARGETS femail DESTINATION libexec/tarvod)
 
 # The unit names the daemon where this prefix puts it.
 install(CODE "

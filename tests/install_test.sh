@@ -32,7 +32,7 @@ actual=$(cd "$tmp/root" && find . \( -type f -o -type l -o -type d -empty \) |
 want=$(printf '%s\n' "${expected[@]}" | sort)
 diff <(echo "$want") <(echo "$actual") || fail "installed files differ (- expected, + installed)"
 
-for b in usr/sbin/tarvod usr/bin/tarvodctl; do [ -x "$tmp/root/$b" ] || fail "$b not executable"; done
+for b in usr/sbin/tarvod usr/bin/tarvodctl usr/libexec/tarvod/femail; do [ -x "$tmp/root/$b" ] || fail "$b not executable"; done
 grep -qx 'ExecStart=/usr/sbin/tarvod' "$tmp/root/lib/systemd/system/tarvod.service" || fail "unit ExecStart"
 bash -n "$tmp/root/usr/share/bash-completion/completions/tarvodctl" || fail "completion syntax"
 

@@ -98,6 +98,9 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   BuildLevelNameTable();
   SetDefaultCommandTimeout(static_cast<double>(
       std::max<int64_t>(0, ConfigurationInteger(mConfiguration, "commandTimeout"))));
+  SetMailPrograms(
+      ConfigurationString(mConfiguration, "mailProgram", "/usr/bin/mail"),
+      ConfigurationString(mConfiguration, "relayMailProgram", "/usr/libexec/tarvod/femail"));
   InitHostStats();
   ConfigureStructuredLog(ConfigurationString(mConfiguration, "structuredLogPath", ""));
   if (!DefaultStructuredLog().canDeliver()) {

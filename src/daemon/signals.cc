@@ -54,6 +54,9 @@ void InstallSignalHandlers() {
   Install(SIGINT, OnStop);
   Install(SIGHUP, OnReload);
   Install(SIGUSR1, OnUser);
+  // A mail program that closes its input early must not end the daemon: the write fails with
+  // EPIPE instead.
+  Install(SIGPIPE, SIG_IGN);
 }
 
 bool TakeStopRequest() { return gStopRequest.exchange(0) == 1; }

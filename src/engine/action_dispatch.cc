@@ -6,6 +6,7 @@
 #include "actions/log_action.h"
 #include "actions/post_notification.h"
 #include "actions/run_command_action.h"
+#include "actions/send_email_action.h"
 #include "engine/keyword_tables.h"
 #include "engine/rule_processor.h"
 #include "platform/diagnostic_log.h"
@@ -40,9 +41,15 @@ RunCommandAction& RunCommandHandler() {
   return runCommand;
 }
 
-// The handler of an action code; nullptr for the keywords that do nothing in this build
-// (the mail handlers come later, and sendmessage, sendqe, addtodb and publishrss have
-// none).
+// The mail handlers: normal mode, and the short-message mode of pages and text messages.
+SendEmailAction& MailHandler(bool shortMessage) {
+  static SendEmailAction mail(ProcessLauncher::Real(), false);
+  static SendEmailAction shortMail(ProcessLauncher::Real(), true);
+  return shortMessage ? shortMail : mail;
+}
+
+// The handler of an action code; nullptr for the keywords that do nothing (sendmessage,
+// sendqe, addtodb and publishrss have none).
 Action* HandlerFor(long code) {
   static LogAction log;
   static DebugDumpAction debugDump;
@@ -50,6 +57,11 @@ Action* HandlerFor(long code) {
   switch (code) {
     case kLog:
       return &log;
+    case kSendEmail:
+      return &MailHandler(false);
+    case kSendPage:
+    case kSendSms:
+      return &MailHandler(true);
     case kRunCommand:
       return &RunCommandHandler();
     case kPostNotification:
@@ -63,7 +75,16 @@ Action* HandlerFor(long code) {
 
 }  // namespace
 
-void SetDefaultCommandTimeout(double seconds) { RunCommandHandler().setDefaultTimeout(seconds); }
+void SetDefaultCommandTimeout(double seconds) {
+  RunCommandHandler().setDefaultTimeout(seconds);
+  MailHandler(false).setTimeout(seconds);
+  MailHandler(true).setTimeout(seconds);
+}
+
+void SetMailPrograms(const std::string& local, const std::string& relay) {
+  MailHandler(false).setPrograms(MailPrograms{local, relay});
+  MailHandler(true).setPrograms(MailPrograms{local, relay});
+}
 
 void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Context& context) {
   const plist::Value* type = action.find("type");

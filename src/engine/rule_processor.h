@@ -2,6 +2,8 @@
 // the processing queue.
 #pragma once
 
+#include <string>
+
 #include "actions/action.h"
 #include "context/context.h"
 
@@ -16,6 +18,8 @@ bool IsUserInGroup(const std::string& user, const std::string& group);
 void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Context& context);
 // The time limit in seconds of run-command actions without their own; 0: none.
 void SetDefaultCommandTimeout(double seconds);
+// The programs of the mail actions: the local mail command and the relay helper.
+void SetMailPrograms(const std::string& local, const std::string& relay);
 // True when the rule fired.
 bool ProcessRule(const Rule& rule, Context& context);
 

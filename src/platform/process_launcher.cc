@@ -66,6 +66,7 @@ struct ChildPlan {
   ChildRedirection redirections[3];
   const char* workingDirectory;  // nullptr: stay
   MessageText chdirFailure;
+  MessageText execFailure;
   int logFd;  // a close-on-exec duplicate of the error log; -1 without one
 };
 
@@ -184,7 +185,8 @@ TARVOD_CHILD_CODE int ChildMain(void* argument) {
   }
 
   execve(plan.program, plan.argv, plan.envp);
-  _exit(errno);
+  const int error = errno;
+  FailChild(plan, plan.execFailure, error, error);
 }
 
 // The child's status once it has ended; reaps it and closes its pidfd.
@@ -218,6 +220,58 @@ bool AwaitEnd(const ChildProcess& child, double seconds) {
     if (ready < 0 && errno != EINTR) return true;  // the reap that follows reports what it can
     if (ready == 0 && milliseconds == 0) return false;
   }
+}
+
+// Writes input to the pipe's write end and closes it, giving up after seconds (0: never).
+// SIGPIPE is held back on this thread while it writes, and one it raised is taken before the
+// mask is restored, so a program that closes its input early cannot end the daemon even where
+// the signal is not ignored: the write then fails with EPIPE.
+Status FeedInput(int fd, const std::string& input, double seconds, size_t* written) {
+  using Clock = std::chrono::steady_clock;
+  const auto deadline = Clock::now() + std::chrono::duration<double>(seconds);
+  sigset_t pipeSignal;
+  sigset_t previous;
+  sigemptyset(&pipeSignal);
+  sigaddset(&pipeSignal, SIGPIPE);
+  pthread_sigmask(SIG_BLOCK, &pipeSignal, &previous);
+  fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
+  Status status = Status::Ok();
+  *written = 0;
+  while (*written < input.size()) {
+    const ssize_t count = write(fd, input.data() + *written, input.size() - *written);
+    if (count > 0) {
+      *written += static_cast<size_t>(count);
+      continue;
+    }
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0 && errno != EAGAIN) {
+      status = Status::Error(errno, "write to standard input");
+      break;
+    }
+    int milliseconds = -1;
+    if (seconds > 0) {
+      const std::chrono::duration<double, std::milli> left = deadline - Clock::now();
+      milliseconds =
+          left.count() <= 0 ? 0 : static_cast<int>(std::ceil(std::min(left.count(), 3.6e6)));
+      if (milliseconds == 0) {
+        status = Status::Error(ETIMEDOUT, "write to standard input");
+        break;
+      }
+    }
+    struct pollfd entry {
+      fd, POLLOUT, 0
+    };
+    if (poll(&entry, 1, milliseconds) < 0 && errno != EINTR) {
+      status = Status::Error(errno, "poll standard input");
+      break;
+    }
+  }
+  close(fd);
+  const struct timespec now {};
+  while (sigtimedwait(&pipeSignal, nullptr, &now) == SIGPIPE) {
+  }
+  pthread_sigmask(SIG_SETMASK, &previous, nullptr);
+  return status;
 }
 
 class RealProcessLauncher final : public ProcessLauncher {
@@ -259,6 +313,12 @@ class RealProcessLauncher final : public ProcessLauncher {
     plan.workingDirectory =
         request.workingDirectory.empty() ? nullptr : request.workingDirectory.c_str();
     plan.chdirFailure = TextOf(request.chdirFailure);
+    plan.execFailure = TextOf(request.execFailure);
+    int inputPipe[2] = {-1, -1};
+    if (request.input) {
+      if (pipe2(inputPipe, O_CLOEXEC) != 0) return Status::Error(errno, "pipe");
+      plan.redirections[0].descriptor = inputPipe[0];
+    }
     plan.logFd = DuplicateErrorLog();
 
     // Kept per thread: the parent waits while the child runs on it, so one is enough.
@@ -277,8 +337,17 @@ class RealProcessLauncher final : public ProcessLauncher {
     const int error = errno;
     pthread_sigmask(SIG_SETMASK, &previous, nullptr);
     if (plan.logFd >= 0) close(plan.logFd);
-    if (pid < 0) return Status::Error(error, "clone");
-    return ChildProcess{pid, pidfd};
+    if (inputPipe[0] >= 0) close(inputPipe[0]);
+    if (pid < 0) {
+      if (inputPipe[1] >= 0) close(inputPipe[1]);
+      return Status::Error(error, "clone");
+    }
+    ChildProcess child{pid, pidfd};
+    if (request.input) {
+      child.input =
+          FeedInput(inputPipe[1], *request.input, request.inputSeconds, &child.inputWritten);
+    }
+    return child;
   }
 
   std::optional<ExitStatus> wait(ChildProcess& child, std::optional<double> seconds) override {

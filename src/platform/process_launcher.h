@@ -59,6 +59,13 @@ struct LaunchRequest {
   // Written when entering workingDirectory fails, which then ends the child with the error
   // number as status; an empty text means the failure is ignored.
   ChildMessage chdirFailure;
+  // Written when executing program fails; the child then ends with the error number.
+  ChildMessage execFailure;
+  // When set, standard input is a new pipe in place of redirections[0]: launch writes this
+  // text to it and closes it before it returns, spending at most inputSeconds on the writing
+  // (0: no limit). A program that ends or closes its input early leaves the rest unwritten.
+  std::optional<std::string> input;
+  double inputSeconds = 0;
 };
 
 // A started child. The pidfd is the caller's until a wait reports the child's end or
@@ -66,6 +73,10 @@ struct LaunchRequest {
 struct ChildProcess {
   pid_t pid = -1;
   int pidfd = -1;
+  // How the writing of LaunchRequest::input went: EPIPE when the program closed its input
+  // early, ETIMEDOUT when inputSeconds passed first; inputWritten bytes reached the pipe.
+  Status input = Status::Ok();
+  size_t inputWritten = 0;
 };
 
 // The status of an ended child: its exit status, or 128 + the signal that ended it.
@@ -76,11 +87,12 @@ class ProcessLauncher {
   virtual ~ProcessLauncher() = default;
 
   // Starts the child in a process group of its own and returns once it has executed the
-  // program or ended. Before the program runs, the child: resets every signal to its default
-  // action with none blocked; changes identity; takes descriptor redirections; closes every
-  // descriptor from 3 up; opens path redirections; enters the working directory. A step that
-  // fails ends it: status 1 (identity, redirection), the error number (working directory,
-  // execution). Fails only when no child could be created.
+  // program or ended, and has taken its input when one is given (within the input's time
+  // limit; the writing never raises SIGPIPE). Before the program runs, the child: resets every
+  // signal to its default action with none blocked; changes identity; takes descriptor
+  // redirections; closes every descriptor from 3 up; opens path redirections; enters the working
+  // directory. A step that fails ends it: status 1 (identity, redirection), the error number
+  // (working directory, execution). Fails only when no child (or no input pipe) could be created.
   virtual Result<ChildProcess> launch(const LaunchRequest& request) = 0;
   // Waits for the child's end, at most seconds when given. nullopt: it still runs.
   virtual std::optional<ExitStatus> wait(ChildProcess& child, std::optional<double> seconds) = 0;
