@@ -109,7 +109,11 @@ Engine::~Engine() {
   }
 }
 
-void Engine::dispatchEvent(const plist::Dictionary& event) {
+void Engine::dispatchEvent(const plist::Dictionary& event) { dispatch(event, nullptr); }
+
+void Engine::dispatchEvent(plist::Dictionary&& event) { dispatch(event, &event); }
+
+void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned) {
   if (!mDispatchOpen.load()) return;
   const plist::Value* typeValue = event.find("eventType");
   if (typeValue == nullptr) return;
@@ -127,8 +131,9 @@ void Engine::dispatchEvent(const plist::Dictionary& event) {
 
   const RulebasePtr rulebase = this->rulebase();
   const double now = mClock.now();
-  // One copy of the event, shared by every job of this dispatch.
-  const auto shared = std::make_shared<const plist::Dictionary>(event);
+  // One event shared by every job of this dispatch: the caller's own when it handed it over.
+  const auto shared = owned ? std::make_shared<const plist::Dictionary>(std::move(*owned))
+                            : std::make_shared<const plist::Dictionary>(event);
   for (const std::string_view prefix : TypePrefixes(type)) {
     auto found = rulebase->find(prefix);
     if (found != rulebase->end()) {
