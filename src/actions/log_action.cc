@@ -104,6 +104,28 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
   }
 }
 
+// Seeks to the end of fd and writes the message and one newline with one call (so that no
+// other writer's bytes can come between them); a short write is reported as the two writes of
+// the line would have reported it, and the newline is still attempted. False when any of the
+// line is missing.
+bool WriteLine(int fd, const std::string& path, const std::string& message) {
+  lseek(fd, 0, SEEK_END);
+  iovec parts[2] = {{const_cast<char*>(message.data()), message.size()},
+                    {const_cast<char*>("\n"), 1}};
+  errno = 0;
+  const ssize_t written = writev(fd, parts, 2);
+  const size_t done = written < 0 ? 0 : static_cast<size_t>(written);
+  if (done == message.size() + 1) return true;
+  if (done < message.size()) {
+    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
+  }
+  errno = 0;
+  if (write(fd, "\n", 1) != 1) {
+    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
+  }
+  return false;
+}
+
 void LogToFile(const std::string& path, const std::string& message) {
   // Neither truncated nor appending: the seek to the end is what places the line.
   const int fd = OpenLogDestination(path.c_str(), O_CREAT, 0644);
@@ -111,16 +133,7 @@ void LogToFile(const std::string& path, const std::string& message) {
     LogMessage(0, "LOG: Cannot open %s errno = %d", path.c_str(), errno);
     return;
   }
-  lseek(fd, 0, SEEK_END);
-  errno = 0;
-  const ssize_t written = write(fd, message.data(), message.size());
-  if (written < 0 || static_cast<size_t>(written) != message.size()) {
-    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
-  }
-  errno = 0;
-  if (write(fd, "\n", 1) != 1) {
-    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
-  }
+  WriteLine(fd, path, message);
   close(fd);
 }
 
@@ -223,8 +236,7 @@ KeptFiles& Kept() {
   return *kept;
 }
 
-// The same bytes as LogToFile, into a kept file: the seek to the end, then the message and the
-// newline in one call.
+// The same bytes as LogToFile, into a kept file.
 void LogToKeptFile(const std::string& path, const std::string& message) {
   KeptFiles& kept = Kept();
   std::lock_guard<std::mutex> guard(kept.lock());
@@ -233,21 +245,7 @@ void LogToKeptFile(const std::string& path, const std::string& message) {
     LogMessage(0, "LOG: Cannot open %s errno = %d", path.c_str(), errno);
     return;
   }
-  lseek(fd, 0, SEEK_END);
-  iovec parts[2] = {{const_cast<char*>(message.data()), message.size()},
-                    {const_cast<char*>("\n"), 1}};
-  errno = 0;
-  const ssize_t written = writev(fd, parts, 2);
-  const size_t done = written < 0 ? 0 : static_cast<size_t>(written);
-  if (done == message.size() + 1) return;
-  // A short write is reported as the two writes would have reported it.
-  if (done < message.size()) {
-    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
-  }
-  errno = 0;
-  if (write(fd, "\n", 1) != 1) {
-    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
-  }
+  if (WriteLine(fd, path, message)) return;
   kept.forget(fd);
 }
 

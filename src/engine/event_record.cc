@@ -16,18 +16,33 @@ constexpr int kRecordPriority = 1;
 // Attributes one record may carry. An event with more keys than this (a sender can send tens
 // of thousands) fails to configure its record instead of making an entry the journal refuses.
 constexpr size_t kMaxRecordAttributes = 1000;
+constexpr size_t kLinearAttributes = 16;
 
 // A record under construction: a later value for a name replaces the earlier one in place.
+// Names are looked up one by one while the record is small (every usual event), through an
+// index once it grows.
 class Record {
  public:
   bool set(const std::string& name, std::string value) {
-    auto found = mIndex.find(name);
-    if (found != mIndex.end()) {
-      mAttributes[found->second].second = std::move(value);
-      return true;
+    if (mAttributes.size() < kLinearAttributes) {
+      for (auto& attribute : mAttributes) {
+        if (attribute.first == name) {
+          attribute.second = std::move(value);
+          return true;
+        }
+      }
+    } else {
+      if (mIndex.empty()) {
+        for (size_t i = 0; i < mAttributes.size(); ++i) mIndex.emplace(mAttributes[i].first, i);
+      }
+      auto found = mIndex.find(name);
+      if (found != mIndex.end()) {
+        mAttributes[found->second].second = std::move(value);
+        return true;
+      }
+      if (mAttributes.size() >= kMaxRecordAttributes) return false;
+      mIndex.emplace(name, mAttributes.size());
     }
-    if (mAttributes.size() >= kMaxRecordAttributes) return false;
-    mIndex.emplace(name, mAttributes.size());
     mAttributes.emplace_back(name, std::move(value));
     return true;
   }

@@ -571,7 +571,19 @@ void AppendDescription(std::string& out, const Value& value, int depth) {
 
 void AppendEscapedString(std::string& out, std::string_view text) {
   out += '"';
-  for (const char c : text) {
+  // Runs of characters that need no escape are appended whole.
+  const auto plain = [](char c) {
+    const auto u = static_cast<unsigned char>(c);
+    return u >= 0x20 && u != 0x7F && c != '"' && c != '\\';
+  };
+  while (!text.empty()) {
+    size_t run = 0;
+    while (run < text.size() && plain(text[run])) ++run;
+    out.append(text.data(), run);
+    text.remove_prefix(run);
+    if (text.empty()) break;
+    const char c = text.front();
+    text.remove_prefix(1);
     const auto u = static_cast<unsigned char>(c);
     switch (c) {
       case '"':
