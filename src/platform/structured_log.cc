@@ -49,14 +49,16 @@ class JournalLog final : public StructuredLog {
  public:
   bool canDeliver() override { return JournalSocketPresent(); }
 
-  bool send(int priority, std::string_view message, const LogAttributes& attributes) override {
+  bool sendAttributes(int priority, std::string_view message,
+                      std::span<const LogAttributeView> attributes) override {
     std::vector<std::string> fields;
     fields.reserve(attributes.size() + 3);
     fields.push_back("SYSLOG_IDENTIFIER=tarvod");
     fields.push_back("PRIORITY=" + std::to_string(priority));
     fields.push_back("MESSAGE=" + std::string(message));
     for (const auto& [name, value] : attributes) {
-      fields.push_back(JournalFieldName(name) + "=" + value);
+      fields.push_back(JournalFieldName(name) + "=");
+      fields.back() += value;
     }
     std::vector<iovec> vectors(fields.size());
     for (size_t i = 0; i < fields.size(); ++i) {
@@ -83,9 +85,16 @@ class JsonLinesLog final : public StructuredLog {
     if (mFd >= 0) close(mFd);
   }
 
-  bool send(int priority, std::string_view message, const LogAttributes& attributes) override {
-    std::string line = "{\"identifier\": \"tarvod\", \"priority\": " + std::to_string(priority) +
-                       ", \"message\": ";
+  bool sendAttributes(int priority, std::string_view message,
+                      std::span<const LogAttributeView> attributes) override {
+    // One lock around the descriptor and the held lines keeps lines whole and in order; the
+    // line is made in place, after the lines held before it.
+    std::lock_guard<std::mutex> guard(mLock);
+    if (mHeld.empty() && !current()) return false;
+    std::string& line = mHeld;
+    line += "{\"identifier\": \"tarvod\", \"priority\": ";
+    line += std::to_string(priority);
+    line += ", \"message\": ";
     plist::AppendEscapedString(line, message);
     line += ", \"attributes\": {";
     bool first = true;
@@ -97,11 +106,6 @@ class JsonLinesLog final : public StructuredLog {
       plist::AppendEscapedString(line, value);
     }
     line += "}}\n";
-
-    // One lock around the descriptor and the held lines keeps lines whole and in order.
-    std::lock_guard<std::mutex> guard(mLock);
-    if (mHeld.empty() && !current()) return false;
-    mHeld += line;
     ++mHeldRecords;
     if (!tHoldRecords || mHeld.size() >= kMaxHeldRecordBytes) return writeHeld();
     return true;

@@ -3,6 +3,7 @@
 // FlushStructuredLog and HoldStructuredLogRecordsOnThisThread may be called from any thread.
 #pragma once
 
+#include <span>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -11,12 +12,19 @@
 namespace tarvod {
 
 using LogAttributes = std::vector<std::pair<std::string, std::string>>;
+// An attribute seen through views, so that a record can be made of the event's own strings.
+using LogAttributeView = std::pair<std::string_view, std::string_view>;
 
 class StructuredLog {
  public:
   virtual ~StructuredLog() = default;
   // Sends one record; false when it could not be delivered.
-  virtual bool send(int priority, std::string_view message, const LogAttributes& attributes) = 0;
+  virtual bool sendAttributes(int priority, std::string_view message,
+                              std::span<const LogAttributeView> attributes) = 0;
+  bool send(int priority, std::string_view message, const LogAttributes& attributes) {
+    std::vector<LogAttributeView> views(attributes.begin(), attributes.end());
+    return sendAttributes(priority, message, views);
+  }
   // False when every record is bound to fail: the journal is the sink and its socket is
   // missing (a host without journald). A file sink is taken to be able to deliver.
   virtual bool canDeliver() { return true; }

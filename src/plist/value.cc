@@ -254,9 +254,24 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) {
   for (const auto& [key, value] : entries) set(key, value);
 }
 
+// Up to this many entries, FromEntries finds repeated keys without a hash table.
+constexpr size_t kLinearFromEntries = 16;
+
 Dictionary Dictionary::FromEntries(std::vector<Entry> entries) {
   Dictionary result;
   result.entries_.reserve(entries.size());
+  if (entries.size() <= kLinearFromEntries) {
+    // Few keys (every usual event): looking back through them costs less than a hash table.
+    for (auto& entry : entries) {
+      Value* taken = result.find(entry.first);
+      if (taken) {
+        *taken = std::move(entry.second);
+      } else {
+        result.entries_.emplace_back(std::move(entry.first), std::move(entry.second));
+      }
+    }
+    return result;
+  }
   // Positions of the keys already taken. The views point into result.entries_, whose storage
   // was reserved above and so never moves.
   std::unordered_map<std::string_view, size_t> positions;
