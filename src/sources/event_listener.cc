@@ -56,6 +56,7 @@ std::optional<plist::Dictionary> ConvertXPCEvent(plist::Dictionary message, uint
   LogMessage(3, "\tdictionary count = %d", static_cast<int>(message.size()));
   if (DebugLevel() >= 3) LogMessage(3, "event: %s:", plist::Describe(message).c_str());
   plist::Dictionary event = std::move(message);
+  event.reserve(event.size() + 2);
   if (!event.contains("senderUID")) event.set("senderUID", std::to_string(AsPrinted(uid)));
   if (!event.contains("senderGID")) event.set("senderGID", std::to_string(AsPrinted(gid)));
   return event;
