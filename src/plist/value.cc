@@ -1,6 +1,7 @@
 #include "plist/value.h"
 
 #include <algorithm>
+#include <array>
 #include <charconv>
 #include <cmath>
 #include <cstdio>
@@ -587,10 +588,12 @@ void AppendDescription(std::string& out, const Value& value, int depth) {
 void AppendEscapedString(std::string& out, std::string_view text) {
   out += '"';
   // Runs of characters that need no escape are appended whole.
-  const auto plain = [](char c) {
-    const auto u = static_cast<unsigned char>(c);
-    return u >= 0x20 && u != 0x7F && c != '"' && c != '\\';
-  };
+  static constexpr auto kPlain = [] {
+    std::array<bool, 256> plain{};
+    for (int u = 0x20; u < 256; ++u) plain[u] = u != 0x7F && u != '"' && u != '\\';
+    return plain;
+  }();
+  const auto plain = [](char c) { return kPlain[static_cast<unsigned char>(c)]; };
   while (!text.empty()) {
     size_t run = 0;
     while (run < text.size() && plain(text[run])) ++run;
