@@ -12,7 +12,7 @@ PACKAGES := build-essential cmake ninja-build pkg-config clang-format \
   dbus-daemon systemd util-linux procps bsd-mailx python3 python3-aiosmtpd scdoc groff-base
 
 .PHONY: all deps build build-asan build-tsan test test-unit test-asan test-tsan test-deb run bench \
-  format clean install uninstall deb
+  bench-e2e format clean install uninstall deb
 
 all: build
 
@@ -54,6 +54,14 @@ test: test-unit test-asan test-tsan test-deb
 
 bench: build
 	@for b in build/bench/*_bench; do [ -x "$$b" ] && "$$b"; done
+
+# The event path end to end (bench/e2e_bench.cc) beside the socket floors and SEC, in one run;
+# E2E_ARGS passes options (--events, --rate, --repeat, --only). Needs SEC; the profilers are
+# for the profiles the benchmark's comment describes.
+BENCH_PACKAGES := sec strace linux-perf
+bench-e2e: build
+	@$(MAKE) --no-print-directory deps PACKAGES="$(BENCH_PACKAGES)"
+	./build/bench/bench_e2e $(E2E_ARGS)
 
 # Starts tarvod in the foreground on the bundled example; everything it writes goes to run/.
 run: build

@@ -5,6 +5,7 @@
 // main thread is still writing its own lines between theirs.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <sys/stat.h>
 
 #include <cstdio>
@@ -153,6 +154,38 @@ TEST_F(DispatchTest, CountsTheEventsOfEachTypeSinceTheRulesWereLoaded) {
         ASSERT_TRUE(daemon.waitForLine(out, "s4\n"));
       });
   EXPECT_EQ(ReadFile(out), "1\ns1\n2\ns2\n3\ns3\ns4\n");
+}
+
+// With keepLogFilesOpen, a log file renamed away (as logrotate does) is followed at the next
+// event, and after a reload; so is the records file, which is always kept open.
+TEST_F(DispatchTest, KeptLogFilesAndTheRecordsFileFollowARotationByRenaming) {
+  extraConfig = {{"keepLogFilesOpen", Bool(true)}};
+  const auto rotate = [](const std::string& path, const std::string& to) {
+    ASSERT_EQ(std::rename(path.c_str(), to.c_str()), 0);
+  };
+  run({RuleXml("any startup", {"startup"},
+               {{"actions", Arr({FileLog("s${startup:eventCounter}", out)})}})},
+      1, [&](Daemon& daemon) {
+        ASSERT_TRUE(daemon.waitForLine(out, "s1\n"));
+        rotate(out, out + ".1");
+        rotate(records, records + ".1");
+        send({"startup.load"});
+        ASSERT_TRUE(daemon.waitForLine(out, "s2\n"));
+        rotate(out, out + ".2");
+        kill(daemon.pid(), SIGHUP);
+        ASSERT_TRUE(daemon.waitForLine(out, "s1\n"));  // the reloaded rules count afresh
+      });
+  EXPECT_EQ(ReadFile(out + ".1"), "s1\n");
+  EXPECT_EQ(ReadFile(out + ".2"), "s2\n");
+  EXPECT_EQ(ReadFile(out), "s1\n");
+  // Two records per startup event (the full type has no rules), none lost or doubled.
+  size_t load = 0;
+  for (const auto& record : ReadJsonRecords(records + ".1")) {
+    load += record.attribute("eventType") == "startup.load";
+  }
+  load += recordsOf("startup.load").size();
+  EXPECT_EQ(load, 4u);
+  EXPECT_EQ(recordsOf("startup.reload").size(), 2u);
 }
 
 TEST_F(DispatchTest, EvaluatesCriteriaInAnyAllAndUnconditionalModes) {

@@ -1,15 +1,19 @@
 #include "actions/log_action.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/uio.h>
 #include <unistd.h>
 
 #include <array>
+#include <atomic>
 #include <cerrno>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <utility>
+#include <vector>
 
 #include "platform/diagnostic_log.h"
 #include "platform/serial_queue.h"
@@ -100,6 +104,28 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
   }
 }
 
+// Seeks to the end of fd and writes the message and one newline with one call (so that no
+// other writer's bytes can come between them); a short write is reported as the two writes of
+// the line would have reported it, and the newline is still attempted. False when any of the
+// line is missing.
+bool WriteLine(int fd, const std::string& path, const std::string& message) {
+  lseek(fd, 0, SEEK_END);
+  iovec parts[2] = {{const_cast<char*>(message.data()), message.size()},
+                    {const_cast<char*>("\n"), 1}};
+  errno = 0;
+  const ssize_t written = writev(fd, parts, 2);
+  const size_t done = written < 0 ? 0 : static_cast<size_t>(written);
+  if (done == message.size() + 1) return true;
+  if (done < message.size()) {
+    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
+  }
+  errno = 0;
+  if (write(fd, "\n", 1) != 1) {
+    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
+  }
+  return false;
+}
+
 void LogToFile(const std::string& path, const std::string& message) {
   // Neither truncated nor appending: the seek to the end is what places the line.
   const int fd = OpenLogDestination(path.c_str(), O_CREAT, 0644);
@@ -107,17 +133,120 @@ void LogToFile(const std::string& path, const std::string& message) {
     LogMessage(0, "LOG: Cannot open %s errno = %d", path.c_str(), errno);
     return;
   }
-  lseek(fd, 0, SEEK_END);
-  errno = 0;
-  const ssize_t written = write(fd, message.data(), message.size());
-  if (written < 0 || static_cast<size_t>(written) != message.size()) {
-    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
-  }
-  errno = 0;
-  if (write(fd, "\n", 1) != 1) {
-    LogMessage(0, "LOG: Cannot write to %s errno = %d", path.c_str(), errno);
-  }
+  WriteLine(fd, path, message);
   close(fd);
+}
+
+// ---- kept files (keepLogFilesOpen) ----
+
+std::atomic<bool> gKeepLogFilesOpen{false};
+std::atomic<uint64_t> gReopenGeneration{0};
+std::atomic<uint64_t> gBatch{0};
+
+struct KeptFile {
+  std::string path;
+  int fd = -1;
+  dev_t device = 0;
+  ino_t inode = 0;
+  uint64_t checkedInBatch = 0;
+  uint64_t lastUse = 0;
+};
+
+// The open files; actions run on the processing queue, the lock only keeps the table sound
+// should another thread ever write a line.
+class KeptFiles {
+ public:
+  // The descriptor for path, opened when needed; -1 with errno set when it cannot be opened.
+  int get(const std::string& path) {
+    const uint64_t generation = gReopenGeneration.load(std::memory_order_relaxed);
+    if (generation != mGeneration) {
+      closeAll();
+      mGeneration = generation;
+    }
+    const uint64_t batch = gBatch.load(std::memory_order_relaxed);
+    ++mUses;
+    for (size_t i = 0; i < mFiles.size(); ++i) {
+      KeptFile& file = mFiles[i];
+      if (file.path != path) continue;
+      if (file.checkedInBatch != batch) {
+        // Rotated (renamed, removed, replaced) since the last batch: write to what the path
+        // names now.
+        struct stat named {};
+        if (stat(path.c_str(), &named) != 0 || named.st_dev != file.device ||
+            named.st_ino != file.inode) {
+          drop(i);
+          break;
+        }
+        file.checkedInBatch = batch;
+      }
+      file.lastUse = mUses;
+      return file.fd;
+    }
+    const int fd = OpenLogDestination(path.c_str(), O_CREAT, 0644);
+    if (fd < 0) return -1;
+    struct stat opened {};
+    if (fstat(fd, &opened) != 0) {
+      const int error = errno;
+      close(fd);
+      errno = error;
+      return -1;
+    }
+    if (mFiles.size() >= kMaxKeptLogFiles) {
+      size_t oldest = 0;
+      for (size_t i = 1; i < mFiles.size(); ++i) {
+        if (mFiles[i].lastUse < mFiles[oldest].lastUse) oldest = i;
+      }
+      drop(oldest);
+    }
+    mFiles.push_back(KeptFile{path, fd, opened.st_dev, opened.st_ino, batch, mUses});
+    return fd;
+  }
+
+  // After a failed write: the next line opens the path again.
+  void forget(int fd) {
+    for (size_t i = 0; i < mFiles.size(); ++i) {
+      if (mFiles[i].fd == fd) {
+        drop(i);
+        return;
+      }
+    }
+  }
+
+  std::mutex& lock() { return mLock; }
+
+ private:
+  void drop(size_t i) {
+    close(mFiles[i].fd);
+    mFiles[i] = std::move(mFiles.back());
+    mFiles.pop_back();
+  }
+  void closeAll() {
+    for (const KeptFile& file : mFiles) close(file.fd);
+    mFiles.clear();
+  }
+
+  std::mutex mLock;
+  std::vector<KeptFile> mFiles;
+  uint64_t mGeneration = 0;
+  uint64_t mUses = 0;
+};
+
+KeptFiles& Kept() {
+  static auto* const kept = new KeptFiles;  // outlives every queue thread
+  return *kept;
+}
+
+// The same bytes as LogToFile, into a kept file.
+void LogToKeptFile(const std::string& path, const std::string& message) {
+  KeptFiles& kept = Kept();
+  std::lock_guard<std::mutex> guard(kept.lock());
+  const int fd = kept.get(path);
+  if (fd < 0) {
+    LogMessage(0, "LOG: Cannot open %s errno = %d", path.c_str(), errno);
+    return;
+  }
+  if (WriteLine(fd, path, message)) return;
+  kept.forget(fd);
 }
 
 }  // namespace
@@ -138,6 +267,15 @@ void BuildLevelNameTable() {
     gLevelNames = &table;
   });
 }
+
+void SetKeepLogFilesOpen(bool keep) {
+  gKeepLogFilesOpen.store(keep);
+  ReopenKeptLogFiles();
+}
+
+void ReopenKeptLogFiles() { gReopenGeneration.fetch_add(1); }
+
+void EndLogBatch() { gBatch.fetch_add(1, std::memory_order_relaxed); }
 
 void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule, Context& context) {
   const auto resolvedMessage = ResolveActionText(action, "message", rule, context);
@@ -164,7 +302,11 @@ void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule, 
   if (!*logPath) return;
   // A slow or stuck file must not keep shutdown from saving the store.
   SerialQueue::BlockingSection blocking;
-  LogToFile(**logPath, message);
+  if (gKeepLogFilesOpen.load(std::memory_order_relaxed)) {
+    LogToKeptFile(**logPath, message);
+  } else {
+    LogToFile(**logPath, message);
+  }
 }
 
 }  // namespace tarvod

@@ -77,15 +77,52 @@ TEST_F(LogActionTest, DoesNothingForAnAbsentOrEmptyMessage) {
 }
 
 TEST_F(LogActionTest, ReportsAFileThatCannotBeOpened) {
-  Run(Dictionary{{"message", "m"}, {"logPath", dir_ + "/missing/out.log"}});
-  EXPECT_NE(capture_.text().find("LOG: Cannot open " + dir_ + "/missing/out.log errno = 2\n"),
-            std::string::npos);
-  // A FIFO is no log file: opened read-write, the daemon would be its own reader.
   const std::string fifo = dir_ + "/fifo";
   ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
-  Run(Dictionary{{"message", "m"}, {"logPath", fifo}});
-  EXPECT_NE(capture_.text().find("LOG: Cannot open " + fifo + " errno = 6\n"), std::string::npos)
-      << capture_.text();
+  for (const bool keep : {false, true}) {
+    SetKeepLogFilesOpen(keep);
+    Run(Dictionary{{"message", "m"}, {"logPath", dir_ + "/missing/out.log"}});
+    EXPECT_NE(capture_.text().find("LOG: Cannot open " + dir_ + "/missing/out.log errno = 2\n"),
+              std::string::npos);
+    // A FIFO is no log file: opened read-write, the daemon would be its own reader.
+    Run(Dictionary{{"message", "m"}, {"logPath", fifo}});
+    EXPECT_NE(capture_.text().find("LOG: Cannot open " + fifo + " errno = 6\n"), std::string::npos)
+        << capture_.text();
+  }
+  SetKeepLogFilesOpen(false);
+}
+
+// keepLogFilesOpen writes the same bytes, and follows a rotation by renaming at the next batch
+// or after a reload, and one by copying and truncating at once.
+TEST_F(LogActionTest, KeptFilesWriteTheSameBytesAndFollowTheirPath) {
+  SetKeepLogFilesOpen(true);
+  const std::string path = dir_ + "/kept.log";
+  const auto line = [&](const std::string& message) {
+    Run(Dictionary{{"message", message}, {"logPath", path}});
+  };
+  WriteAll(path, "existing\n");
+  line("nine char");
+  line("two\nlines ${global:who}");
+  EXPECT_EQ(testing::ReadWholeFile(path), "existing\nnine char\ntwo\nlines root\n");
+
+  ASSERT_EQ(rename(path.c_str(), (path + ".1").c_str()), 0);
+  line("same batch");  // the path is looked up once per batch
+  EndLogBatch();
+  line("next batch");
+  EXPECT_EQ(testing::ReadWholeFile(path + ".1"),
+            "existing\nnine char\ntwo\nlines root\nsame batch\n");
+  EXPECT_EQ(testing::ReadWholeFile(path), "next batch\n");
+
+  ASSERT_EQ(rename(path.c_str(), (path + ".2").c_str()), 0);
+  ReopenKeptLogFiles();
+  line("after reload");
+  EXPECT_EQ(testing::ReadWholeFile(path), "after reload\n");
+
+  ASSERT_EQ(truncate(path.c_str(), 0), 0);
+  line("after truncation");
+  EXPECT_EQ(testing::ReadWholeFile(path), "after truncation\n");
+  EXPECT_EQ(capture_.text().find("Cannot"), std::string::npos) << capture_.text();
+  SetKeepLogFilesOpen(false);
 }
 
 TEST_F(LogActionTest, SelectsTheStructuredLogByLogTypeInAnyCase) {

@@ -96,6 +96,7 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   LogMessage(4, "Velkin rules path is %s", mRulesPath.c_str());
   mConfiguration.set("rulesPath", plist::Value(mRulesPath));
   BuildLevelNameTable();
+  SetKeepLogFilesOpen(ConfigurationInteger(mConfiguration, "keepLogFilesOpen") != 0);
   SetDefaultCommandTimeout(static_cast<double>(
       std::max<int64_t>(0, ConfigurationInteger(mConfiguration, "commandTimeout"))));
   SetMailPrograms(
@@ -188,6 +189,7 @@ void Daemon::ReloadRules() {
   RulebasePtr rulebase = mEngine->loadRules(mRulesPath, &ruleCount);
   LogMessage(1, "Loaded %zu rules\n", ruleCount);
   mEngine->swapRulebase(std::move(rulebase));
+  ReopenKeptLogFiles();
   mEngine->postStartupEvent(true);
   mRunningTimers = CreatePeriodicEvents(mConfiguration, *mMonitor, *mMainLoop, mClock);
   mMonitor->resume();

@@ -9,12 +9,14 @@
 #include <utility>
 #include <vector>
 
+#include "actions/log_action.h"
 #include "context/context.h"
 #include "engine/event_record.h"
 #include "engine/keyword_tables.h"
 #include "engine/rule_processor.h"
 #include "engine/rules_loader.h"
 #include "platform/diagnostic_log.h"
+#include "platform/structured_log.h"
 
 namespace tarvod {
 namespace {
@@ -88,6 +90,14 @@ Engine::Engine(const Clock& clock, plist::Dictionary globals)
       mRulebase(std::make_shared<const Rulebase>()) {
   BuildKeywordTables();
   mVariables->set(kGlobalsKey, plist::Value(std::move(globals)));
+  // Records are written in batches, one write for all the records of the jobs run since the
+  // queue was last idle, so that a busy queue does not pay a write per record.
+  // Kept log files look their paths up again once per batch.
+  mQueue->setIdleHandler([] {
+    FlushStructuredLog();
+    EndLogBatch();
+  });
+  mQueue->async(HoldStructuredLogRecordsOnThisThread);
 }
 
 Engine::~Engine() {
@@ -99,7 +109,11 @@ Engine::~Engine() {
   }
 }
 
-void Engine::dispatchEvent(const plist::Dictionary& event) {
+void Engine::dispatchEvent(const plist::Dictionary& event) { dispatch(event, nullptr); }
+
+void Engine::dispatchEvent(plist::Dictionary&& event) { dispatch(event, &event); }
+
+void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned) {
   if (!mDispatchOpen.load()) return;
   const plist::Value* typeValue = event.find("eventType");
   if (typeValue == nullptr) return;
@@ -117,17 +131,24 @@ void Engine::dispatchEvent(const plist::Dictionary& event) {
 
   const RulebasePtr rulebase = this->rulebase();
   const double now = mClock.now();
-  // One copy of the event, made when a prefix first has rules and shared by every record job
-  // of this dispatch.
-  std::shared_ptr<const plist::Dictionary> shared;
+  // One event shared by every job of this dispatch: the caller's own when it handed it over.
+  const auto shared = owned ? std::make_shared<const plist::Dictionary>(std::move(*owned))
+                            : std::make_shared<const plist::Dictionary>(event);
   for (const std::string_view prefix : TypePrefixes(type)) {
     auto found = rulebase->find(prefix);
     if (found != rulebase->end()) {
-      if (!shared) shared = std::make_shared<const plist::Dictionary>(event);
       QueuePrefix(*mQueue, now, prefix, found->second, shared, rulebase, mVariables, mKeychain);
       continue;
     }
-    if (prefix.size() == type.size()) WriteEventRecord(event, false, false);
+    if (prefix.size() == type.size()) {
+      // The record of a type without rules is written by the processing queue too, in the
+      // order of the queue's other records: the dispatching thread (the input queue) then
+      // does no file or journal I/O of its own, and the record joins the queue's batch.
+      mQueue->async([shared] {
+        SerialQueue::BlockingSection blocking;
+        WriteEventRecord(*shared, false, false);
+      });
+    }
     LogMessage(2, "  Dropping event %.*s because it has no associated rules",
                static_cast<int>(prefix.size()), prefix.data());
   }
@@ -188,6 +209,8 @@ size_t Engine::drain(double seconds) {
   const size_t pending = mQueue->pending();
   mQueue->abandon();
   mAbandoned = true;
+  // The records of the jobs that did run are not left behind with the stuck one.
+  FlushStructuredLog();
   return pending;
 }
 

@@ -29,6 +29,8 @@ class Engine {
   Engine& operator=(const Engine&) = delete;
 
   void dispatchEvent(const plist::Dictionary& event);
+  // The same, keeping the event itself instead of a copy.
+  void dispatchEvent(plist::Dictionary&& event);
   // "startup.load" (or "startup.reload" when reload is true) and "shutdown", from "tarvod".
   void postStartupEvent(bool reload);
   void postShutdownEvent();
@@ -64,6 +66,8 @@ class Engine {
 
  private:
   plist::Dictionary daemonEvent(const char* type) const;
+  // owned, when set, is event itself, which may be moved from once read.
+  void dispatch(const plist::Dictionary& event, plist::Dictionary* owned);
 
   const Clock& mClock;
   std::unique_ptr<SerialQueue> mQueue;

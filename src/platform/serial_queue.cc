@@ -63,6 +63,7 @@ void SerialQueue::sync(const std::function<void()>& job) {
   }
   async([&] {
     job();
+    if (mIdleHandler) mIdleHandler();
     std::lock_guard<std::mutex> lock(doneLock);
     done = true;
     doneSignal.notify_one();
@@ -158,6 +159,11 @@ void SerialQueue::run() {
     job();
     job = nullptr;  // release what the job captured before reporting progress
     lock.lock();
+    if (mJobs.empty() && mIdleHandler) {
+      lock.unlock();
+      mIdleHandler();
+      lock.lock();
+    }
     mJobActive = false;
     mJobGate.notify_all();
     --mPending;

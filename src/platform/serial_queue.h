@@ -29,6 +29,11 @@ class SerialQueue {
 
   const std::string& label() const { return mLabel; }
 
+  // Runs on the queue's thread whenever it runs out of jobs, and after every sync job, before
+  // the waits for that job return: work held back until the queue is idle (records written
+  // in batches) is done before anyone who waits for the queue looks. Set before the first job.
+  void setIdleHandler(std::function<void()> handler) { mIdleHandler = std::move(handler); }
+
   void async(std::function<void()> job);
   // Runs job on the queue after every job submitted before it, and waits for it.
   void sync(const std::function<void()>& job);
@@ -78,6 +83,7 @@ class SerialQueue {
   std::condition_variable mWorkAvailable;
   std::condition_variable mProgress;
   std::deque<std::function<void()>> mJobs;
+  std::function<void()> mIdleHandler;
   size_t mPending = 0;
   bool mStopping = false;
   bool mAbandoned = false;

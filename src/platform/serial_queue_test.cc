@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <mutex>
 #include <thread>
 #include <vector>
 
@@ -36,6 +37,40 @@ TEST(SerialQueue, RunsJobsOneAtATimeInSubmissionOrderFromManyThreads) {
     EXPECT_GT(v % 1000, last[v / 1000]);
     last[v / 1000] = v % 1000;
   }
+}
+
+// The idle handler runs once the queue has run out of jobs, and before a sync job's waiter or
+// a drain returns, so that work held back until then (batched records) is visible to them.
+TEST(SerialQueue, RunsTheIdleHandlerWhenEmptyAndBeforeWaitsReturn) {
+  SerialQueue queue("test.idle");
+  std::atomic<int> jobsDone{0};
+  std::atomic<int> jobsAtFirstIdle{-1};
+  std::atomic<int> idles{0};
+  std::atomic<bool> syncRan{false};
+  std::atomic<bool> idleAfterSync{false};
+  queue.setIdleHandler([&] {
+    int unset = -1;
+    jobsAtFirstIdle.compare_exchange_strong(unset, jobsDone.load());
+    if (syncRan) idleAfterSync = true;
+    ++idles;
+  });
+  std::mutex gate;
+  gate.lock();
+  queue.async([&] {
+    std::lock_guard<std::mutex> wait(gate);  // holds the queue until all three are in
+    ++jobsDone;
+  });
+  queue.async([&] { ++jobsDone; });
+  queue.async([&] { ++jobsDone; });
+  gate.unlock();
+  queue.sync([&] { syncRan = true; });
+  EXPECT_TRUE(idleAfterSync);
+  EXPECT_EQ(jobsAtFirstIdle, 3);
+  EXPECT_TRUE(queue.drainFor(5.0));
+  const int before = idles;
+  queue.async([&] { ++jobsDone; });
+  EXPECT_TRUE(queue.drainFor(5.0));  // returns once the idle handler has run too
+  EXPECT_EQ(idles, before + 1);
 }
 
 TEST(SerialQueue, SyncFromTheQueueItselfRunsInline) {

@@ -49,14 +49,16 @@ class JournalLog final : public StructuredLog {
  public:
   bool canDeliver() override { return JournalSocketPresent(); }
 
-  bool send(int priority, std::string_view message, const LogAttributes& attributes) override {
+  bool sendAttributes(int priority, std::string_view message,
+                      std::span<const LogAttributeView> attributes) override {
     std::vector<std::string> fields;
     fields.reserve(attributes.size() + 3);
     fields.push_back("SYSLOG_IDENTIFIER=tarvod");
     fields.push_back("PRIORITY=" + std::to_string(priority));
     fields.push_back("MESSAGE=" + std::string(message));
     for (const auto& [name, value] : attributes) {
-      fields.push_back(JournalFieldName(name) + "=" + value);
+      fields.push_back(JournalFieldName(name) + "=");
+      fields.back() += value;
     }
     std::vector<iovec> vectors(fields.size());
     for (size_t i = 0; i < fields.size(); ++i) {
@@ -71,13 +73,28 @@ class JournalLog final : public StructuredLog {
   }
 };
 
+thread_local bool tHoldRecords = false;
+
+// The file is kept open between records. Before the first record of each batch (a held batch,
+// or each record of a thread that holds none) the path is looked up again: when it now names
+// another file, or none, because the file was rotated or removed, the file is opened afresh.
 class JsonLinesLog final : public StructuredLog {
  public:
   explicit JsonLinesLog(std::string path) : mPath(std::move(path)) {}
+  ~JsonLinesLog() override {
+    if (mFd >= 0) close(mFd);
+  }
 
-  bool send(int priority, std::string_view message, const LogAttributes& attributes) override {
-    std::string line = "{\"identifier\": \"tarvod\", \"priority\": " + std::to_string(priority) +
-                       ", \"message\": ";
+  bool sendAttributes(int priority, std::string_view message,
+                      std::span<const LogAttributeView> attributes) override {
+    // One lock around the descriptor and the held lines keeps lines whole and in order; the
+    // line is made in place, after the lines held before it.
+    std::lock_guard<std::mutex> guard(mLock);
+    if (mHeld.empty() && !current()) return false;
+    std::string& line = mHeld;
+    line += "{\"identifier\": \"tarvod\", \"priority\": ";
+    line += std::to_string(priority);
+    line += ", \"message\": ";
     plist::AppendEscapedString(line, message);
     line += ", \"attributes\": {";
     bool first = true;
@@ -89,26 +106,76 @@ class JsonLinesLog final : public StructuredLog {
       plist::AppendEscapedString(line, value);
     }
     line += "}}\n";
+    ++mHeldRecords;
+    if (!tHoldRecords || mHeld.size() >= kMaxHeldRecordBytes) return writeHeld();
+    return true;
+  }
 
-    // One lock around open and write keeps lines from interleaving; the file is opened per
-    // record so that it can be rotated away underneath the daemon.
+  void flush() override {
     std::lock_guard<std::mutex> guard(mLock);
+    if (!mHeld.empty()) writeHeld();
+  }
+
+  void retire() override {
+    std::lock_guard<std::mutex> guard(mLock);
+    if (!mHeld.empty()) writeHeld();
+    if (mFd >= 0) close(mFd);
+    mFd = -1;
+  }
+
+ private:
+  // Makes mFd the file the path names now; false (and logged by the caller) when it cannot be
+  // opened.
+  bool current() {
+    if (mFd >= 0) {
+      struct stat named {};
+      if (stat(mPath.c_str(), &named) == 0 && named.st_dev == mDevice && named.st_ino == mInode) {
+        return true;
+      }
+      close(mFd);
+      mFd = -1;
+    }
     const int fd = OpenLogDestination(mPath.c_str(), O_CREAT | O_APPEND | O_NOFOLLOW, 0644);
     if (fd < 0) return false;
+    struct stat opened {};
+    if (fstat(fd, &opened) != 0) {
+      close(fd);
+      return false;
+    }
+    mFd = fd;
+    mDevice = opened.st_dev;
+    mInode = opened.st_ino;
+    return true;
+  }
+
+  // Writes what is held; false when some of it was lost.
+  bool writeHeld() {
     size_t written = 0;
-    while (written < line.size()) {
-      const ssize_t n = write(fd, line.data() + written, line.size() - written);
+    while (mFd >= 0 && written < mHeld.size()) {
+      const ssize_t n = write(mFd, mHeld.data() + written, mHeld.size() - written);
       if (n < 0 && errno == EINTR) continue;
       if (n <= 0) break;
       written += static_cast<size_t>(n);
     }
-    close(fd);
-    return written == line.size();
+    const bool ok = written == mHeld.size();
+    if (!ok) {
+      const int error = errno;
+      // Lines already out stay; the rest is dropped rather than retried into a half line.
+      LogMessage(0, "Failed to write %zu event records to %s errno = %d", mHeldRecords,
+                 mPath.c_str(), error);
+    }
+    mHeld.clear();
+    mHeldRecords = 0;
+    return ok;
   }
 
- private:
   const std::string mPath;
   std::mutex mLock;
+  int mFd = -1;
+  dev_t mDevice = 0;
+  ino_t mInode = 0;
+  std::string mHeld;
+  size_t mHeldRecords = 0;
 };
 
 // Every sink ever made lives until the process ends, so a reference that DefaultStructuredLog
@@ -119,7 +186,8 @@ std::atomic<StructuredLog*> gCurrent{nullptr};
 
 void Install(std::unique_ptr<StructuredLog> sink) {
   std::lock_guard<std::mutex> guard(gSinkLock);
-  gCurrent.store(sink.get());
+  StructuredLog* replaced = gCurrent.exchange(sink.get());
+  if (replaced) replaced->retire();
   gSinks.push_back(std::move(sink));
 }
 
@@ -152,6 +220,12 @@ void ConfigureStructuredLog(const std::string& jsonLinesPath) {
   } else {
     Install(std::make_unique<JsonLinesLog>(jsonLinesPath));
   }
+}
+
+void HoldStructuredLogRecordsOnThisThread() { tHoldRecords = true; }
+
+void FlushStructuredLog() {
+  if (StructuredLog* current = gCurrent.load()) current->flush();
 }
 
 StructuredLog& DefaultStructuredLog() {

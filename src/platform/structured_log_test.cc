@@ -135,6 +135,50 @@ TEST_F(JsonLinesSink, KeepsLinesWholeWhenTwoThreadsSendAtOnce) {
   }
 }
 
+// The file stays open between records; a rotation by renaming or removing it is followed at
+// the next record (or batch), one by truncation at once.
+TEST_F(JsonLinesSink, FollowsThePathWhenTheFileIsRotated) {
+  ASSERT_TRUE(DefaultStructuredLog().send(5, "one", {}));
+  ASSERT_EQ(rename(path_.c_str(), (path_ + ".1").c_str()), 0);
+  ASSERT_TRUE(DefaultStructuredLog().send(5, "two", {}));
+  ASSERT_EQ(unlink(path_.c_str()), 0);
+  ASSERT_TRUE(DefaultStructuredLog().send(5, "three", {}));
+  ASSERT_EQ(truncate(path_.c_str(), 0), 0);
+  ASSERT_TRUE(DefaultStructuredLog().send(5, "four", {}));
+  const auto old = testing::ReadJsonRecords(path_ + ".1");
+  const auto now = testing::ReadJsonRecords(path_);
+  ASSERT_EQ(old.size(), 1u);
+  EXPECT_EQ(old[0].message, "one");
+  ASSERT_EQ(now.size(), 1u);
+  EXPECT_EQ(now[0].message, "four");
+  EXPECT_EQ(testing::ReadWholeFile(path_).find('\0'), std::string::npos);
+}
+
+// A holding thread's records wait for the flush (or the size limit); another thread's record
+// is written at once, after them, in order.
+TEST_F(JsonLinesSink, HoldsTheRecordsOfAHoldingThreadUntilFlushed) {
+  std::thread([&] {
+    HoldStructuredLogRecordsOnThisThread();
+    ASSERT_TRUE(DefaultStructuredLog().send(5, "held 1", {}));
+    ASSERT_TRUE(DefaultStructuredLog().send(5, "held 2", {}));
+    EXPECT_EQ(testing::ReadJsonRecords(path_).size(), 0u);
+    FlushStructuredLog();
+    EXPECT_EQ(testing::ReadJsonRecords(path_).size(), 2u);
+    ASSERT_TRUE(DefaultStructuredLog().send(5, "held 3", {}));
+  }).join();
+  ASSERT_TRUE(DefaultStructuredLog().send(5, "direct", {}));
+  std::thread([&] {
+    HoldStructuredLogRecordsOnThisThread();
+    const LogAttributes big = {{"padding", std::string(kMaxHeldRecordBytes, 'p')}};
+    ASSERT_TRUE(DefaultStructuredLog().send(5, "large", big));
+  }).join();
+  const auto records = testing::ReadJsonRecords(path_);
+  ASSERT_EQ(records.size(), 5u);
+  EXPECT_EQ(records[2].message, "held 3");
+  EXPECT_EQ(records[3].message, "direct");
+  EXPECT_EQ(records[4].message, "large");
+}
+
 TEST(JournalSink, FailsWithoutAJournalSocket) {
   if (access("/run/systemd/journal/socket", F_OK) == 0) GTEST_SKIP() << "journald is running";
   ConfigureStructuredLog("");

@@ -229,10 +229,7 @@ class BinaryChecker {
 
   // The list's value once check() has passed; the check's bookkeeping is freed first.
   std::optional<Value> read() {
-    mState = {};
-    mHeight = {};
-    mExpanded = {};
-    mExpandedBytes = {};
+    mNodes = {};
     return valueOf(mTop, 0);
   }
 
@@ -265,10 +262,7 @@ class BinaryChecker {
     static_assert(kMaxFileSize + 1024 < (uint64_t{1} << 32), "expanded sizes are kept in 32 bits");
     static_assert(kMaxExpansionFactor * kMaxFileSize + kExpansionAllowance < (uint64_t{1} << 32),
                   "expanded byte sizes are kept in 32 bits");
-    mState.assign(count, kUnvisited);
-    mHeight.assign(count, 0);
-    mExpanded.assign(count, 0);
-    mExpandedBytes.assign(count, 0);
+    mNodes.assign(count, Node{});
     return walk(top);
   }
 
@@ -414,7 +408,7 @@ class BinaryChecker {
     if (!readObject(top, object)) return false;
     if (!IsContainer(object.type)) return PayloadBytes(object) <= mByteBudget;
     const auto push = [&](uint64_t index, const Object& o) {
-      mState[index] = kOnPath;
+      mNodes[index].state = kOnPath;
       const uint64_t refs = o.type == 0xD ? 2 * o.count : o.count;
       stack.push_back(Frame{index, o, refs, 0, 1, 0, 1});
     };
@@ -424,10 +418,10 @@ class BinaryChecker {
       if (frame.next == frame.refs) {
         const Frame done = frame;
         stack.pop_back();
-        mState[done.index] = kDone;
-        mExpanded[done.index] = static_cast<uint32_t>(done.expanded);
-        mExpandedBytes[done.index] = static_cast<uint32_t>(done.bytes);
-        mHeight[done.index] = static_cast<uint16_t>(done.height);
+        mNodes[done.index].state = kDone;
+        mNodes[done.index].expanded = static_cast<uint32_t>(done.expanded);
+        mNodes[done.index].expandedBytes = static_cast<uint32_t>(done.bytes);
+        mNodes[done.index].height = static_cast<uint16_t>(done.height);
         if (!stack.empty() && !addChild(stack.back(), done.expanded, done.bytes, done.height)) {
           return false;
         }
@@ -437,12 +431,14 @@ class BinaryChecker {
       const uint64_t child = refAt(frame, k);
       if (child >= mCount) return false;
       const bool isKey = frame.object.type == 0xD && k < frame.object.count;
-      if (mState[child] == kOnPath) return false;  // an object that contains itself
-      if (mState[child] == kDone) {
+      if (mNodes[child].state == kOnPath) return false;  // an object that contains itself
+      if (mNodes[child].state == kDone) {
         if (isKey && !isStringObject(child)) return false;
         // A shared container nests as deep below this reference as below its first one.
-        if (stack.size() + mHeight[child] > static_cast<size_t>(kMaxNestingDepth)) return false;
-        if (!addChild(frame, mExpanded[child], mExpandedBytes[child], mHeight[child])) {
+        if (stack.size() + mNodes[child].height > static_cast<size_t>(kMaxNestingDepth))
+          return false;
+        if (!addChild(frame, mNodes[child].expanded, mNodes[child].expandedBytes,
+                      mNodes[child].height)) {
           return false;
         }
         continue;
@@ -454,11 +450,11 @@ class BinaryChecker {
         push(child, object);  // invalidates frame
         continue;
       }
-      mState[child] = kDone;
-      mExpanded[child] = 1;
-      mExpandedBytes[child] = static_cast<uint32_t>(PayloadBytes(object));
-      mHeight[child] = 0;
-      if (!addChild(frame, 1, mExpandedBytes[child], 0)) return false;
+      mNodes[child].state = kDone;
+      mNodes[child].expanded = 1;
+      mNodes[child].expandedBytes = static_cast<uint32_t>(PayloadBytes(object));
+      mNodes[child].height = 0;
+      if (!addChild(frame, 1, mNodes[child].expandedBytes, 0)) return false;
     }
     return true;
   }
@@ -598,12 +594,16 @@ class BinaryChecker {
   uint64_t mTop = 0;
   uint64_t mBudget = 0;
   uint64_t mByteBudget = 0;
-  std::vector<State> mState;
-  // Per declared object, so kept narrow: heights are at most kMaxNestingDepth and expanded
-  // sizes at most their budgets, which are below 2^32 for any input within kMaxFileSize.
-  std::vector<uint16_t> mHeight;
-  std::vector<uint32_t> mExpanded;
-  std::vector<uint32_t> mExpandedBytes;
+  // Per declared object, so kept narrow (and in one allocation): heights are at most
+  // kMaxNestingDepth and expanded sizes at most their budgets, which are below 2^32 for any
+  // input within kMaxFileSize.
+  struct Node {
+    uint32_t expanded = 0;
+    uint32_t expandedBytes = 0;
+    uint16_t height = 0;
+    State state = kUnvisited;
+  };
+  std::vector<Node> mNodes;
 };
 
 // ---------------------------------------------------------------------------------------------

@@ -1,6 +1,7 @@
 #include "plist/value.h"
 
 #include <algorithm>
+#include <array>
 #include <charconv>
 #include <cmath>
 #include <cstdio>
@@ -254,9 +255,24 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) {
   for (const auto& [key, value] : entries) set(key, value);
 }
 
+// Up to this many entries, FromEntries finds repeated keys without a hash table.
+constexpr size_t kLinearFromEntries = 16;
+
 Dictionary Dictionary::FromEntries(std::vector<Entry> entries) {
   Dictionary result;
   result.entries_.reserve(entries.size());
+  if (entries.size() <= kLinearFromEntries) {
+    // Few keys (every usual event): looking back through them costs less than a hash table.
+    for (auto& entry : entries) {
+      Value* taken = result.find(entry.first);
+      if (taken) {
+        *taken = std::move(entry.second);
+      } else {
+        result.entries_.emplace_back(std::move(entry.first), std::move(entry.second));
+      }
+    }
+    return result;
+  }
   // Positions of the keys already taken. The views point into result.entries_, whose storage
   // was reserved above and so never moves.
   std::unordered_map<std::string_view, size_t> positions;
@@ -571,7 +587,21 @@ void AppendDescription(std::string& out, const Value& value, int depth) {
 
 void AppendEscapedString(std::string& out, std::string_view text) {
   out += '"';
-  for (const char c : text) {
+  // Runs of characters that need no escape are appended whole.
+  static constexpr auto kPlain = [] {
+    std::array<bool, 256> plain{};
+    for (int u = 0x20; u < 256; ++u) plain[u] = u != 0x7F && u != '"' && u != '\\';
+    return plain;
+  }();
+  const auto plain = [](char c) { return kPlain[static_cast<unsigned char>(c)]; };
+  while (!text.empty()) {
+    size_t run = 0;
+    while (run < text.size() && plain(text[run])) ++run;
+    out.append(text.data(), run);
+    text.remove_prefix(run);
+    if (text.empty()) break;
+    const char c = text.front();
+    text.remove_prefix(1);
     const auto u = static_cast<unsigned char>(c);
     switch (c) {
       case '"':

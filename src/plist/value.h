@@ -153,6 +153,8 @@ class Dictionary {
 
   // Replaces the value of an existing key in place, or appends the key.
   void set(std::string_view key, Value value);
+  // Room for n entries, so that n - size() new keys can be set without moving the others.
+  void reserve(size_t n) { entries_.reserve(n); }
   bool erase(std::string_view key);
   void clear() { entries_.clear(); }
   // The keys in ascending order of their bytes (the order assignments are made in).

@@ -34,7 +34,7 @@ std::optional<plist::Value> ReadEventPacket(std::string_view packet);
 
 // The message dictionary with senderUID and senderGID added ("%d" of the effective IDs)
 // unless the sender set them.
-std::optional<plist::Dictionary> ConvertXPCEvent(const plist::Dictionary& message, uint32_t uid,
+std::optional<plist::Dictionary> ConvertXPCEvent(plist::Dictionary message, uint32_t uid,
                                                  uint32_t gid);
 
 // The admitted connections. They live as long as the Monitor, not the listener.

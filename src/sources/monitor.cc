@@ -60,9 +60,9 @@ bool Monitor::filterBySourceUID(uint32_t uid, uint32_t gid) const {
   return false;
 }
 
-void Monitor::processEvent(const plist::Dictionary& event) {
+void Monitor::processEvent(plist::Dictionary event) {
   if (DebugLevel() >= 3) LogMessage(3, "Event received: %s ", plist::Describe(event).c_str());
-  if (mHooks.dispatch) mHooks.dispatch(event);
+  if (mHooks.dispatch) mHooks.dispatch(std::move(event));
 }
 
 int Monitor::SetXPCListenerFor(EventLoop& queue) {

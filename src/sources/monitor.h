@@ -38,7 +38,8 @@ std::optional<IdSet> ParseFilterList(std::optional<std::string_view> text);
 // What the Monitor hands events to, and how it watches the rule engine's backlog. Tests
 // replace them; EngineHooks (monitor_engine.h) wires them to an Engine.
 struct MonitorHooks {
-  std::function<void(const plist::Dictionary&)> dispatch;
+  // Takes the event over: the engine keeps it without a copy.
+  std::function<void(plist::Dictionary&&)> dispatch;
   // Jobs waiting on the processing queue; empty: no back-pressure.
   std::function<size_t()> backlog;
   // Asks for progressDescriptor to become readable once at most the given number of jobs
@@ -92,7 +93,7 @@ class Monitor {
   // A blocking reader of mAuditpipe that the daemon does not use; returns the error number
   // that ended it, or -1 when it could not start.
   int runAuditpipeListener();
-  void processEvent(const plist::Dictionary& event);
+  void processEvent(plist::Dictionary event);
   // A notification observed for an event type (notifications.cc): its user information is
   // the event, an absent one an empty event.
   void processNotification(const Notification& notification);

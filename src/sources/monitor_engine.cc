@@ -5,7 +5,7 @@ namespace tarvod {
 MonitorHooks EngineHooks(Engine& engine) {
   SerialQueue& queue = engine.queue();
   return MonitorHooks{
-      [&engine](const plist::Dictionary& event) { engine.dispatchEvent(event); },
+      [&engine](plist::Dictionary&& event) { engine.dispatchEvent(std::move(event)); },
       [&queue] { return queue.pending(); },
       [&queue](size_t limit) { queue.signalWhenPendingAtMost(limit); },
       queue.progressDescriptor(),

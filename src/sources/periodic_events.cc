@@ -100,7 +100,7 @@ void Monitor::periodicEvent(const plist::Dictionary& event) {
     LogMessage(3, "Periodic Event received: %s ", plist::Describe(event).c_str());
   }
   // Not processEvent: periodic events are not reported as "Event received".
-  if (mHooks.dispatch) mHooks.dispatch(event);
+  if (mHooks.dispatch) mHooks.dispatch(plist::Dictionary(event));
 }
 
 }  // namespace tarvod
