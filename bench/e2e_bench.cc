@@ -51,6 +51,10 @@
 
 #include "platform/seqpacket.h"
 #include "plist/codec.h"
+#include "process_status.h"
+
+using tarvod::bench::ProcStatusKb;
+using tarvod::bench::XmlString;
 
 namespace {
 
@@ -354,17 +358,6 @@ std::optional<double> RunSec(const std::string& directory, size_t events, size_t
 }
 
 // ---- the daemon ----
-
-std::string XmlString(const std::string& s) { return "<string>" + s + "</string>"; }
-
-long ProcStatusKb(pid_t pid, const char* field) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(in, line)) {
-    if (line.rfind(field, 0) == 0) return std::atol(line.c_str() + std::strlen(field));
-  }
-  return -1;
-}
 
 // CPU nanoseconds per thread name, summed over the threads of that name.
 std::map<std::string, uint64_t> ThreadCpu(pid_t pid) {

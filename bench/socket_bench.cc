@@ -22,6 +22,10 @@
 #include <vector>
 
 #include "platform/seqpacket.h"
+#include "process_status.h"
+
+using tarvod::bench::ProcStatusKb;
+using tarvod::bench::XmlString;
 
 namespace {
 
@@ -106,17 +110,6 @@ void BM_SocketAlone(benchmark::State& state) {
   std::filesystem::remove_all(directory);
 }
 
-long ProcStatusKb(pid_t pid, const char* field) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(in, line)) {
-    if (line.rfind(field, 0) == 0) return std::atol(line.c_str() + std::strlen(field));
-  }
-  return -1;
-}
-
-std::string StringXml(const std::string& s) { return "<string>" + s + "</string>"; }
-
 // The daemon end to end.
 void BM_DaemonEndToEnd(benchmark::State& state) {
   const int connections = static_cast<int>(state.range(0));
@@ -130,9 +123,9 @@ void BM_DaemonEndToEnd(benchmark::State& state) {
     std::ofstream(directory + "/tarvod.plist")
         << "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
            "<key>config</key><dict><key>errorLogPath</key>"
-        << StringXml(directory + "/error.log") << "<key>structuredLogPath</key>"
-        << StringXml(directory + "/records.jsonl") << "<key>stateDirectory</key>"
-        << StringXml(directory + "/state") << "<key>eventSocketPath</key>" << StringXml(socketPath)
+        << XmlString(directory + "/error.log") << "<key>structuredLogPath</key>"
+        << XmlString(directory + "/records.jsonl") << "<key>stateDirectory</key>"
+        << XmlString(directory + "/state") << "<key>eventSocketPath</key>" << XmlString(socketPath)
         << "</dict></dict></plist>\n";
     std::ofstream(directory + "/rules.plist")
         << "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><array><dict>"
@@ -144,7 +137,7 @@ void BM_DaemonEndToEnd(benchmark::State& state) {
            "<string>${event:n}</string><integer>0</integer></array></dict></array>"
            "<key>actions</key><array><dict><key>type</key><string>log</string>"
            "<key>message</key><string>${event:id}</string><key>logPath</key>"
-        << StringXml(output) << "</dict></array></dict></array></plist>\n";
+        << XmlString(output) << "</dict></array></dict></array></plist>\n";
   }
   const std::string config = directory + "/tarvod.plist";
   const std::string rules = directory + "/rules.plist";
