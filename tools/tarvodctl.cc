@@ -38,6 +38,7 @@
 #include "plist/codec.h"
 #include "plist/value.h"
 #include "sources/event_listener.h"
+#include "tarvodctl_rules.h"
 
 namespace {
 
@@ -46,16 +47,19 @@ constexpr const char* kDefaultConfiguration = "/etc/tarvod.d/tarvod.plist";
 // A password longer than this is no password: set refuses it.
 constexpr size_t kMaxPasswordBytes = 64 * 1024;
 
-int Usage() {
-  std::fprintf(stderr,
-               "usage: tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]\n"
+int Usage(FILE* out = stderr) {
+  std::fprintf(out,
+               "usage: tarvodctl [-c CONFIG] check [-r RULES] [--strict] [--json]\n"
+               "       tarvodctl [-c CONFIG] test [-r RULES] TYPE [key=value ...]\n"
+               "       tarvodctl [-c CONFIG] test [-r RULES] --plist FILE\n"
+               "       tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]\n"
                "       tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE\n"
                "       tarvodctl post NAME OBJECT [key=value ...]\n"
                "       tarvodctl post --plist FILE NAME OBJECT\n"
                "       tarvodctl [-c CONFIG] keychain [--keychain PATH] set|get|delete SERVICE "
                "ACCOUNT\n"
                "       tarvodctl [-c CONFIG] keychain [--keychain PATH] list\n");
-  return 2;
+  return out == stderr ? 2 : 0;
 }
 
 int Fail(const std::string& message) {
@@ -285,6 +289,25 @@ bool IsKeychainCommand(const std::vector<std::string>& args) {
 
 int main(int argc, char** argv) {
   const std::vector<std::string> args(argv + 1, argv + argc);
+  if (!args.empty() && (args[0] == "--help" || args[0] == "-h")) return Usage(stdout);
+  // check and test: -c may stand before or after the command word.
+  for (size_t i = 0; i < args.size(); i += args[i] == "-c" ? 2 : 1) {
+    if (args[i] == "-c") continue;
+    if (args[i] != "check" && args[i] != "test") break;
+    std::string configurationPath = kDefaultConfiguration;
+    std::vector<std::string> rest;
+    for (size_t j = 0; j < args.size(); ++j) {
+      if (j == i) continue;
+      if (args[j] == "-c" && j + 1 < args.size()) {
+        configurationPath = args[++j];
+      } else {
+        rest.push_back(args[j]);
+      }
+    }
+    const int status = args[i] == "check" ? RunCheck(rest, configurationPath)
+                                          : RunTest(rest, configurationPath);
+    return status == 2 ? Usage() : status;
+  }
   if (IsKeychainCommand(args)) {
     KeychainCommand keychain;
     if (!ParseKeychain(args, keychain)) return Usage();

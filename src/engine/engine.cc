@@ -147,15 +147,17 @@ void Engine::postStartupEvent(bool reload) {
 
 void Engine::postShutdownEvent() { dispatchEvent(daemonEvent("shutdown")); }
 
-RulebasePtr Engine::loadRules(const std::string& path, size_t* count) {
+RulebasePtr Engine::loadRules(const std::string& path, size_t* count, LoadReport* report) {
+  std::error_code error;
+  const bool directory =
+      PathExtension(path).empty() || std::filesystem::is_directory(path, error);
   auto rulebase = std::make_shared<Rulebase>();
   size_t loaded = 0;
   withVariables([&](VariableStore&) {
     // A reload also picks up a store replaced with its old modification time.
     if (mKeychain) mKeychain->forget();
-    loaded = PathExtension(path).empty()
-                 ? LoadRulesDirectory(*rulebase, mVariables, path, mKeychain)
-                 : LoadRulesFile(*rulebase, mVariables, path, mKeychain);
+    loaded = directory ? LoadRulesDirectory(*rulebase, mVariables, path, mKeychain, report)
+                       : LoadRulesFile(*rulebase, mVariables, path, mKeychain, report);
   });
   if (count) *count = loaded;
   return rulebase;

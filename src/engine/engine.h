@@ -11,6 +11,7 @@
 #include <string>
 
 #include "context/types.h"
+#include "engine/rules_check.h"
 #include "platform/clock.h"
 #include "platform/serial_queue.h"
 #include "plist/value.h"
@@ -33,10 +34,11 @@ class Engine {
   void postStartupEvent(bool reload);
   void postShutdownEvent();
 
-  // Reads the rules at path (one file when its last component has an extension, else the
-  // whole tree) into a new rulebase, on the queue, since "eval on load" variables write the
-  // store. *count receives the number of rules loaded.
-  RulebasePtr loadRules(const std::string& path, size_t* count);
+  // Reads the rules at path (the whole tree when it names a directory or its last component
+  // has no extension, else one file) into a new rulebase, on the queue, since "eval on load"
+  // variables write the store. *count receives the number of rules loaded; report, when given,
+  // what was read and every problem found.
+  RulebasePtr loadRules(const std::string& path, size_t* count, LoadReport* report = nullptr);
   // The rulebase events are dispatched against.
   RulebasePtr rulebase() const;
   // One indivisible exchange: an event dispatched meanwhile sees the whole old rulebase or the
