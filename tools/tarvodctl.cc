@@ -304,8 +304,8 @@ int main(int argc, char** argv) {
         rest.push_back(args[j]);
       }
     }
-    const int status = args[i] == "check" ? RunCheck(rest, configurationPath)
-                                          : RunTest(rest, configurationPath);
+    const int status =
+        args[i] == "check" ? RunCheck(rest, configurationPath) : RunTest(rest, configurationPath);
     return status == 2 ? Usage() : status;
   }
   if (IsKeychainCommand(args)) {

@@ -66,18 +66,19 @@ bool ParseRulesOptions(const std::vector<std::string>& args, RulesOptions& optio
 }
 
 void PrintJson(const tarvod::LoadReport& report, size_t errors, size_t warnings) {
-  std::printf("{\"filesRead\": %zu, \"filesSkipped\": %zu, \"rulesLoaded\": %zu, "
-              "\"errors\": %zu, \"warnings\": %zu, \"problems\": [",
-              report.filesRead, report.filesSkipped, report.rulesLoaded, errors, warnings);
+  std::printf(
+      "{\"filesRead\": %zu, \"filesSkipped\": %zu, \"rulesLoaded\": %zu, "
+      "\"errors\": %zu, \"warnings\": %zu, \"problems\": [",
+      report.filesRead, report.filesSkipped, report.rulesLoaded, errors, warnings);
   const char* separator = "";
   for (const Problem& problem : report.problems) {
-    std::printf("%s\n  {\"severity\": \"%s\", \"file\": %s, \"rule\": %zu, \"name\": %s, "
-                "\"key\": %s, \"message\": %s, \"text\": %s}",
-                separator, problem.severity == Problem::Severity::kError ? "error" : "warning",
-                JsonString(problem.file).c_str(), problem.rule,
-                JsonString(problem.ruleName).c_str(), JsonString(problem.keyPath).c_str(),
-                JsonString(problem.message).c_str(),
-                JsonString(tarvod::FormatProblem(problem)).c_str());
+    std::printf(
+        "%s\n  {\"severity\": \"%s\", \"file\": %s, \"rule\": %zu, \"name\": %s, "
+        "\"key\": %s, \"message\": %s, \"text\": %s}",
+        separator, problem.severity == Problem::Severity::kError ? "error" : "warning",
+        JsonString(problem.file).c_str(), problem.rule, JsonString(problem.ruleName).c_str(),
+        JsonString(problem.keyPath).c_str(), JsonString(problem.message).c_str(),
+        JsonString(tarvod::FormatProblem(problem)).c_str());
     separator = ",";
   }
   std::printf("%s]}\n", report.problems.empty() ? "" : "\n");

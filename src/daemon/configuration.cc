@@ -1,9 +1,10 @@
 #include "daemon/configuration.h"
 
+#include <sys/stat.h>
+
 #include <algorithm>
 #include <array>
 #include <cmath>
-#include <sys/stat.h>
 
 #include "plist/codec.h"
 
@@ -14,11 +15,11 @@ using Severity = Problem::Severity;
 
 constexpr std::array<std::string_view, 2> kTopLevelKeys = {"config", "initialGlobals"};
 constexpr std::array<std::string_view, 8> kStringKeys = {
-    "errorLogPath",  "eventLogPath",      "keychainPath", "structuredLogPath",
+    "errorLogPath",    "eventLogPath",  "keychainPath",   "structuredLogPath",
     "eventSocketPath", "authLogSource", "stateDirectory", "rulesPath"};
 constexpr std::array<std::string_view, 2> kIdListKeys = {"filterByUID", "filterByGID"};
 constexpr std::array<std::string_view, 6> kNumberKeys = {
-    "debugLevel",    "logRepeatInterval",     "shutdownTimeout",
+    "debugLevel",     "logRepeatInterval",     "shutdownTimeout",
     "commandTimeout", "connectionIdleTimeout", "maxConnectionsPerUID"};
 constexpr std::array<std::string_view, 2> kSwitchKeys = {"logEvents", "saveState"};
 constexpr std::array<std::string_view, 3> kPeriodicKeys = {"eventType", "startInterval",
@@ -65,7 +66,8 @@ void CheckPeriodicEvents(const plist::Value& entries, const std::string& path,
     }
     for (const std::string& key : entry->sortedKeys()) {
       if (Contains(kPeriodicKeys, key)) continue;
-      add(Severity::kError, at + "." + key, "unknown key, ignored" + Suggestion(key, kPeriodicKeys));
+      add(Severity::kError, at + "." + key,
+          "unknown key, ignored" + Suggestion(key, kPeriodicKeys));
     }
     const plist::Value* type = entry->find("eventType");
     if (type == nullptr || !type->isString()) {
@@ -76,11 +78,13 @@ void CheckPeriodicEvents(const plist::Value& entries, const std::string& path,
       const double period = interval->numberValue();
       if (!(period > 0) || !std::isfinite(period)) {
         add(Severity::kError, at + ".startInterval",
-            "\"" + interval->textForm() + "\" is not a positive number of seconds; no timer is "
-            "created");
+            "\"" + interval->textForm() +
+                "\" is not a positive number of seconds; no timer is "
+                "created");
       }
     } else if (const plist::Value* time = entry->find("startTime"); time && !time->isNumber()) {
-      add(Severity::kError, at + ".startTime", "must be an integer number of minutes after midnight");
+      add(Severity::kError, at + ".startTime",
+          "must be an integer number of minutes after midnight");
     } else if (time == nullptr) {
       add(Severity::kWarning, at, "neither startInterval nor startTime; fires daily at midnight");
     }

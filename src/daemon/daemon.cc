@@ -42,6 +42,23 @@ void LogSecuritySession() {
   LogMessage(4, "Velkin security session id = %x (%d)", static_cast<unsigned>(session), status);
 }
 
+// Each problem of the configuration and the rules at level 1, then one summary line at level 0,
+// so that the service's log shows a wrong rule without raising the debug level.
+RulebasePtr LoadRulesReporting(Engine& engine, const std::string& configurationPath,
+                               const std::string& rulesPath, size_t* count) {
+  LoadReport report;
+  CheckConfiguration(configurationPath, report.problems);
+  RulebasePtr rulebase = engine.loadRules(rulesPath, count, &report);
+  for (const Problem& problem : report.problems) {
+    LogMessage(1, "%s", FormatProblem(problem).c_str());
+  }
+  LogMessage(
+      0, "Rules from %s: %zu files read, %zu rules loaded, %zu files skipped, %zu problems found",
+      rulesPath.c_str(), report.filesRead, report.rulesLoaded, report.filesSkipped,
+      report.problems.size());
+  return rulebase;
+}
+
 std::optional<IdSet> FilterList(const plist::Dictionary& configuration, const char* key) {
   const plist::Value* value = configuration.find(key);
   return ParseFilterList(value ? std::optional<std::string>(value->textForm()) : std::nullopt);
@@ -107,7 +124,7 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   }
 
   size_t ruleCount = 0;
-  mEngine->swapRulebase(mEngine->loadRules(mRulesPath, &ruleCount));
+  mEngine->swapRulebase(LoadRulesReporting(*mEngine, mConfigurationPath, mRulesPath, &ruleCount));
   LogMessage(1, "Loaded %zu rules\n", ruleCount);
   if (ruleCount == 0) {
     LogMessage(0, "No rules found in %s, quitting....", mRulesPath.c_str());
@@ -180,7 +197,7 @@ void Daemon::ReloadRules() {
   CancelPeriodicEvents(mRunningTimers);
   UnregisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
   size_t ruleCount = 0;
-  RulebasePtr rulebase = mEngine->loadRules(mRulesPath, &ruleCount);
+  RulebasePtr rulebase = LoadRulesReporting(*mEngine, mConfigurationPath, mRulesPath, &ruleCount);
   LogMessage(1, "Loaded %zu rules\n", ruleCount);
   mEngine->swapRulebase(std::move(rulebase));
   mEngine->postStartupEvent(true);

@@ -149,8 +149,7 @@ void Engine::postShutdownEvent() { dispatchEvent(daemonEvent("shutdown")); }
 
 RulebasePtr Engine::loadRules(const std::string& path, size_t* count, LoadReport* report) {
   std::error_code error;
-  const bool directory =
-      PathExtension(path).empty() || std::filesystem::is_directory(path, error);
+  const bool directory = PathExtension(path).empty() || std::filesystem::is_directory(path, error);
   auto rulebase = std::make_shared<Rulebase>();
   size_t loaded = 0;
   withVariables([&](VariableStore&) {

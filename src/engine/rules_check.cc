@@ -15,34 +15,41 @@ namespace {
 using Names = std::span<const std::string_view>;
 using Severity = Problem::Severity;
 
-constexpr std::array<std::string_view, 10> kRuleKeys = {
-    "name",     "enabled",   "eventTypes",            "criterion",
-    "actions",  "variables", "allowPartialCriterionMatch", "loadVariablesFromFile",
-    "loadVariablesWithRule", "filePath"};
+constexpr std::array<std::string_view, 10> kRuleKeys = {"name",
+                                                        "enabled",
+                                                        "eventTypes",
+                                                        "criterion",
+                                                        "actions",
+                                                        "variables",
+                                                        "allowPartialCriterionMatch",
+                                                        "loadVariablesFromFile",
+                                                        "loadVariablesWithRule",
+                                                        "filePath"};
 constexpr std::array<std::string_view, 2> kCriterionKeys = {"operator", "operands"};
 constexpr std::array<std::string_view, 19> kOperators = {
-    "true",        "equal",       "greaterthan", "lessthan",       "greaterthanequal",
-    "lessthanequal", "notequal",  "groupmember", "notgroupmember", "beginswith",
-    "endswith",    "contains",    "notcontains", "sortsbefore",    "sortsafter",
-    "defined",     "notdefined",  "empty",       "notempty"};
+    "true",          "equal",      "greaterthan", "lessthan",       "greaterthanequal",
+    "lessthanequal", "notequal",   "groupmember", "notgroupmember", "beginswith",
+    "endswith",      "contains",   "notcontains", "sortsbefore",    "sortsafter",
+    "defined",       "notdefined", "empty",       "notempty"};
 constexpr std::array<std::string_view, 12> kActionTypes = {
-    "nullaction", "log",       "sendemail", "sendmessage", "sendqe",     "postnotification",
-    "sendpage",   "sendsms",   "runcommand", "addtodb",    "publishrss", "debugdump"};
-constexpr std::array<std::string_view, 7> kLogKeys = {"type",     "message",  "logType", "logPath",
+    "nullaction", "log",     "sendemail",  "sendmessage", "sendqe",     "postnotification",
+    "sendpage",   "sendsms", "runcommand", "addtodb",     "publishrss", "debugdump"};
+constexpr std::array<std::string_view, 7> kLogKeys = {"type",     "message", "logType", "logPath",
                                                       "facility", "details", "logLevel"};
 constexpr std::array<std::string_view, 11> kRunCommandKeys = {
-    "type",      "command",    "arguments",  "workingDirectory", "environment", "stdinPath",
-    "stdoutPath", "stderrPath", "user",      "group",            "timeout"};
+    "type",        "command",   "arguments",  "workingDirectory",
+    "environment", "stdinPath", "stdoutPath", "stderrPath",
+    "user",        "group",     "timeout"};
 constexpr std::array<std::string_view, 4> kPostNotificationKeys = {"type", "name", "message",
                                                                    "details"};
 constexpr std::array<std::string_view, 9> kMailKeys = {
-    "type",       "recipientAddresses", "ccAddresses",           "relayHost",         "adminEmail",
-    "subject",    "message",            "localizationBundlePath", "localizationTable"};
+    "type",    "recipientAddresses",     "ccAddresses",      "relayHost", "adminEmail", "subject",
+    "message", "localizationBundlePath", "localizationTable"};
 constexpr std::array<std::string_view, 2> kDebugDumpKeys = {"type", "data"};
 constexpr std::array<std::string_view, 1> kTypeOnly = {"type"};
 constexpr std::array<std::string_view, 3> kDumpData = {"all", "globals", "rulebase"};
-constexpr std::array<std::string_view, 8> kLogLevels = {
-    "emergency", "alert", "critical", "error", "warning", "notice", "info", "debug"};
+constexpr std::array<std::string_view, 8> kLogLevels = {"emergency", "alert",  "critical", "error",
+                                                        "warning",   "notice", "info",     "debug"};
 constexpr std::array<std::string_view, 4> kNamespaces = {"builtin", "event", "keychain", "global"};
 constexpr std::array<std::string_view, 5> kBuiltins = {"now", "hostName", "hostIP", "hostIPv6",
                                                        "eventDictionary"};
@@ -199,8 +206,8 @@ void RuleChecker::criterion(const plist::Value& entry, const std::string& path) 
   if ((keyword == "equal" || keyword == "notequal") && list.size() > 1) {
     for (size_t i = 0; i < 2; ++i) {
       const plist::Value& other = list[1 - i];
-      const bool reference = other.isString() && other.string().starts_with("${") &&
-                             other.string().ends_with("}");
+      const bool reference =
+          other.isString() && other.string().starts_with("${") && other.string().ends_with("}");
       if (!list[i].isString() || !reference || list[i].string().empty()) continue;
       const std::string& text = list[i].string();
       char* end = nullptr;
@@ -245,9 +252,8 @@ void RuleChecker::action(const plist::Value& entry, const std::string& path) {
     if (const plist::Value* level = dictionary->find("logLevel")) {
       if (!level->isString() || !Contains(kLogLevels, LowerCase(level->string()))) {
         const std::string shown = level->textForm();
-        add(Severity::kError, Join(path, "logLevel"),
-            "unknown log level \"%s\"%s; notice is used", shown.c_str(),
-            Suggestion(LowerCase(shown), kLogLevels).c_str());
+        add(Severity::kError, Join(path, "logLevel"), "unknown log level \"%s\"%s; notice is used",
+            shown.c_str(), Suggestion(LowerCase(shown), kLogLevels).c_str());
       }
     }
     const plist::Value* details = dictionary->find("details");
@@ -335,7 +341,8 @@ void RuleChecker::check(const plist::Value& element) {
   if (const plist::Value* criteria = rule->find("criterion")) {
     if (criteria->isArray()) {
       size_t i = 0;
-      for (const plist::Value& entry : criteria->array()) criterion(entry, Indexed("criterion", ++i));
+      for (const plist::Value& entry : criteria->array())
+        criterion(entry, Indexed("criterion", ++i));
     } else {
       add(Severity::kError, "criterion", "must be an array, not %s; the rule never fires",
           KindName(*criteria));
@@ -383,8 +390,8 @@ std::string NameProblem(std::string_view reference) {
         if (rest.ends_with(key)) return "";
       }
     }
-    return "unknown builtin variable \"" + std::string(rest) + "\"" +
-           Suggestion(rest, kBuiltins) + "; it has no value";
+    return "unknown builtin variable \"" + std::string(rest) + "\"" + Suggestion(rest, kBuiltins) +
+           "; it has no value";
   }
   // Any other name with a colon is a key of the event's metadata.
   const size_t last = name.rfind(':');
@@ -412,8 +419,8 @@ std::string FormatProblem(const Problem& problem) {
 }
 
 size_t LoadReport::count(Problem::Severity severity) const {
-  return static_cast<size_t>(std::count_if(problems.begin(), problems.end(),
-                                           [&](const Problem& p) { return p.severity == severity; }));
+  return static_cast<size_t>(std::count_if(
+      problems.begin(), problems.end(), [&](const Problem& p) { return p.severity == severity; }));
 }
 
 void CheckRule(const plist::Value& element, const std::string& file, size_t index,

@@ -19,9 +19,9 @@ struct Problem {
   enum class Severity { kWarning, kError };
   Severity severity = Severity::kError;
   std::string file;
-  size_t rule = 0;        // counted from 1; 0 when the problem concerns the whole file
-  std::string ruleName;   // as written; empty when the rule has none
-  std::string keyPath;    // "criterion[1].operator", indices counted from 1; may be empty
+  size_t rule = 0;       // counted from 1; 0 when the problem concerns the whole file
+  std::string ruleName;  // as written; empty when the rule has none
+  std::string keyPath;   // "criterion[1].operator", indices counted from 1; may be empty
   std::string message;
 };
 

@@ -36,8 +36,8 @@ void AssignLoadTimeVariables(const VariableStorePtr& variables, const std::strin
 // Copies editors and package managers leave beside the file they replace: loading them would
 // run an old rule next to its new version.
 bool IsLeftover(std::string_view name) {
-  for (const std::string_view ending : {"~", ".swp", ".dpkg-old", ".dpkg-new", ".dpkg-dist",
-                                        ".rpmsave", ".rpmnew"}) {
+  for (const std::string_view ending :
+       {"~", ".swp", ".dpkg-old", ".dpkg-new", ".dpkg-dist", ".rpmsave", ".rpmnew"}) {
     if (name.ends_with(ending)) return true;
   }
   return false;

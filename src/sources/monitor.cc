@@ -86,7 +86,7 @@ void Monitor::beginListening() {
 
   LogMessage(1, "Starting the New XPC event listener");
   if (SetXPCListenerFor(*mInputEvtQ) != 0) {
-    LogMessage(1, "XPC event listener failed to start up");
+    LogMessage(0, "XPC event listener failed to start up");
   }
 
   if (mAuthLogSource == "journal") {
