@@ -43,6 +43,7 @@ bool ProcessRule(const Rule& rule, Context& context) {
   const std::string filePath = filePathValue ? filePathValue->textForm() : std::string();
   LogMessage(2, "PROCESSING RULE: %s (%s)", name.c_str(),
              filePathValue ? filePath.c_str() : "(null)");
+  const RuleMessageScope scope(name, filePath);
   if (DebugLevel() >= 5) LogMessage(5, "  Description:\n%s", plist::Describe(rule).c_str());
 
   const plist::Value* criterionValue = rule.find("criterion");
