@@ -1,11 +1,15 @@
 #include "tarvodctl_rules.h"
 
+#include <unistd.h>
+
 #include <cstdio>
 #include <optional>
 
 #include "daemon/configuration.h"
 #include "engine/engine.h"
 #include "platform/clock.h"
+#include "platform/diagnostic_log.h"
+#include "plist/codec.h"
 
 namespace {
 
@@ -117,4 +121,47 @@ int RunCheck(const std::vector<std::string>& args, const std::string& configurat
   return errors > 0 || (options.strict && warnings > 0) ? 1 : 0;
 }
 
-int RunTest(const std::vector<std::string>&, const std::string&) { return 2; }
+int RunTest(const std::vector<std::string>& args, const std::string& configurationPath) {
+  RulesOptions options;
+  if (!ParseRulesOptions(args, options) || options.strict || options.json) return 2;
+  plist::Dictionary event;
+  if (!options.operands.empty() && options.operands[0] == "--plist") {
+    if (options.operands.size() != 2) return 2;
+    const auto file = plist::ReadPropertyListFile(options.operands[1]);
+    if (!file || !file->isDictionary()) {
+      std::fprintf(stderr, "tarvodctl: %s is not a property-list dictionary\n",
+                   options.operands[1].c_str());
+      return 1;
+    }
+    event = file->dictionary();
+  } else {
+    if (options.operands.empty() || options.operands[0].find('=') != std::string::npos) return 2;
+    plist::Dictionary details;
+    for (size_t i = 1; i < options.operands.size(); ++i) {
+      const std::string& pair = options.operands[i];
+      const size_t equals = pair.find('=');
+      if (equals == std::string::npos) return 2;
+      details.set(pair.substr(0, equals), pair.substr(equals + 1));
+    }
+    event.set("eventType", options.operands[0]);
+    event.set("eventDetails", std::move(details));
+  }
+
+  // The problems the rules run into (a substitution that fails, an unknown user) are the
+  // daemon's level-0 messages: they go to standard error.
+  tarvod::AttachErrorLog(dup(STDERR_FILENO));
+  plist::Dictionary globals;
+  tarvod::LoadConfiguration(configurationPath, &globals, nullptr);
+  tarvod::Engine engine(tarvod::Clock::System(), std::move(globals));
+  size_t count = 0;
+  engine.swapRulebase(engine.loadRules(options.rulesPath, &count));
+  if (count == 0) {
+    std::fprintf(stderr, "tarvodctl: no rules loaded from %s\n", options.rulesPath.c_str());
+    return 1;
+  }
+  const std::vector<std::string> lines = engine.dryRunEvent(event);
+  if (lines.empty()) std::printf("no rules for this event type or its prefixes\n");
+  for (const std::string& line : lines) std::printf("%s\n", line.c_str());
+  tarvod::CloseLogs();
+  return 0;
+}

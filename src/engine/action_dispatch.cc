@@ -65,12 +65,21 @@ Action* HandlerFor(long code) {
 
 void SetDefaultCommandTimeout(double seconds) { RunCommandHandler().setDefaultTimeout(seconds); }
 
-void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Context& context) {
+void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Context& context,
+                   DryRun* dryRun) {
   const plist::Value* type = action.find("type");
   const std::string written = type ? type->textForm() : "(null)";
   const long code = type ? ActionCode(LowerCase(written)).value_or(kNullAction) : kNullAction;
   LogMessage(2, "  Executing action %s (%ld)", written.c_str(), code);
-  if (Action* handler = HandlerFor(code)) handler->perform(action, rule, context);
+  Action* handler = HandlerFor(code);
+  if (dryRun != nullptr) {
+    const std::optional<std::string> described =
+        handler ? handler->describe(action, rule, context) : std::string("does nothing");
+    dryRun->note("  action %s: %s", written.c_str(),
+                 described ? described->c_str() : "fails (see the message above)");
+  } else if (handler) {
+    handler->perform(action, rule, context);
+  }
   LogMessage(2, "%s", "");
 }
 

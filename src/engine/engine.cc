@@ -38,15 +38,22 @@ std::vector<std::string_view> TypePrefixes(std::string_view type) {
 void QueuePrefix(SerialQueue& queue, double now, std::string_view prefix,
                  const RulebaseEntry& entry, const std::shared_ptr<const plist::Dictionary>& event,
                  const RulebasePtr& rulebase, const VariableStorePtr& variables,
-                 const std::shared_ptr<Keychain>& keychain) {
+                 const std::shared_ptr<Keychain>& keychain, DryRun* dryRun) {
   LogMessage(2, "  Processing event: %.*s", static_cast<int>(prefix.size()), prefix.data());
   auto context = std::make_shared<Context>(variables, rulebase, *event, keychain);
 
   // The counter runs in the rulebase entry, so "prefix:eventCounter" counts the events of
   // this prefix since the rules were loaded (a reload starts a new rulebase at 0); the
-  // context's copy is the count including this event.
-  const uint64_t count = entry.eventCounter.fetch_add(1, std::memory_order_relaxed) + 1;
-  entry.lastEventTimestamp.store(now, std::memory_order_relaxed);
+  // context's copy is the count including this event. A dry run leaves both alone.
+  uint64_t count = entry.eventCounter.load(std::memory_order_relaxed) + 1;
+  if (dryRun == nullptr) {
+    count = entry.eventCounter.fetch_add(1, std::memory_order_relaxed) + 1;
+    entry.lastEventTimestamp.store(now, std::memory_order_relaxed);
+  } else {
+    queue.async([dryRun, prefix = std::string(prefix), n = entry.rules.size()] {
+      dryRun->note("type prefix %s: %zu rules", prefix.c_str(), n);
+    });
+  }
   const std::string name(prefix);
   context->eventMetadata().set(name + ":eventCounter",
                                plist::Value::Integer(static_cast<int64_t>(count)));
@@ -56,10 +63,11 @@ void QueuePrefix(SerialQueue& queue, double now, std::string_view prefix,
   const std::vector<RulePtr>& rules = entry.rules;
   auto fired = std::make_shared<std::atomic<bool>>(false);
   for (const RulePtr& rule : rules) {
-    queue.async([rule, context, fired] {
-      if (ProcessRule(*rule, *context)) fired->store(true);
+    queue.async([rule, context, fired, dryRun] {
+      if (ProcessRule(*rule, *context, dryRun)) fired->store(true);
     });
   }
+  if (dryRun) return;
   // On the serial queue the record job runs after every rule job queued above, which is the
   // wait on the prefix's rule jobs.
   const bool hasRules = !rules.empty();
@@ -99,7 +107,18 @@ Engine::~Engine() {
   }
 }
 
-void Engine::dispatchEvent(const plist::Dictionary& event) {
+void Engine::dispatchEvent(const plist::Dictionary& event) { dispatch(event, nullptr); }
+
+std::vector<std::string> Engine::dryRunEvent(const plist::Dictionary& event) {
+  DryRun dryRun;
+  withVariables(
+      [&](VariableStore& store) { dryRun.variables = std::make_shared<VariableStore>(store); });
+  dispatch(event, &dryRun);
+  withVariables([](VariableStore&) {});  // after the event's jobs
+  return std::move(dryRun.lines);
+}
+
+void Engine::dispatch(const plist::Dictionary& event, DryRun* dryRun) {
   if (!mDispatchOpen.load()) return;
   const plist::Value* typeValue = event.find("eventType");
   if (typeValue == nullptr) return;
@@ -112,7 +131,7 @@ void Engine::dispatchEvent(const plist::Dictionary& event) {
                type.size(), components, kMaxEventTypeBytes, kMaxEventTypeComponents);
     return;
   }
-  LogEvent(event);
+  if (dryRun == nullptr) LogEvent(event);
   LogMessage(1, "EVENT RECEIVED: %s", type.c_str());
 
   const RulebasePtr rulebase = this->rulebase();
@@ -124,10 +143,11 @@ void Engine::dispatchEvent(const plist::Dictionary& event) {
     auto found = rulebase->find(prefix);
     if (found != rulebase->end()) {
       if (!shared) shared = std::make_shared<const plist::Dictionary>(event);
-      QueuePrefix(*mQueue, now, prefix, found->second, shared, rulebase, mVariables, mKeychain);
+      QueuePrefix(*mQueue, now, prefix, found->second, shared, rulebase,
+                  dryRun ? dryRun->variables : mVariables, mKeychain, dryRun);
       continue;
     }
-    if (prefix.size() == type.size()) WriteEventRecord(event, false, false);
+    if (prefix.size() == type.size() && dryRun == nullptr) WriteEventRecord(event, false, false);
     LogMessage(2, "  Dropping event %.*s because it has no associated rules",
                static_cast<int>(prefix.size()), prefix.data());
   }

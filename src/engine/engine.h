@@ -9,6 +9,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <vector>
 
 #include "context/types.h"
 #include "engine/rules_check.h"
@@ -19,6 +20,7 @@
 namespace tarvod {
 
 class Keychain;
+struct DryRun;
 
 class Engine {
  public:
@@ -30,6 +32,10 @@ class Engine {
   Engine& operator=(const Engine&) = delete;
 
   void dispatchEvent(const plist::Dictionary& event);
+  // The same dispatch in dry-run mode (DryRun in rule_processor.h): the rules run on a copy of
+  // the variable store, event counters and records are left alone, actions only say what they
+  // would do. Waits for the event's jobs and returns the report's lines. Main thread.
+  std::vector<std::string> dryRunEvent(const plist::Dictionary& event);
   // "startup.load" (or "startup.reload" when reload is true) and "shutdown", from "tarvod".
   void postStartupEvent(bool reload);
   void postShutdownEvent();
@@ -65,6 +71,7 @@ class Engine {
   void setKeychain(std::shared_ptr<Keychain> keychain) { mKeychain = std::move(keychain); }
 
  private:
+  void dispatch(const plist::Dictionary& event, DryRun* dryRun);
   plist::Dictionary daemonEvent(const char* type) const;
 
   const Clock& mClock;
