@@ -206,17 +206,22 @@ void RuleChecker::criterion(const plist::Value& entry, const std::string& path) 
   if ((keyword == "equal" || keyword == "notequal") && list.size() > 1) {
     for (size_t i = 0; i < 2; ++i) {
       const plist::Value& other = list[1 - i];
-      const bool reference =
+      const bool isReference =
           other.isString() && other.string().starts_with("${") && other.string().ends_with("}");
-      if (!list[i].isString() || !reference || list[i].string().empty()) continue;
+      if (!list[i].isString() || !isReference || list[i].string().empty()) continue;
       const std::string& text = list[i].string();
       char* end = nullptr;
       std::strtod(text.c_str(), &end);
       if (end == text.c_str() + text.size()) {
+        // Operands are substituted as text, so a literal number is a string here too; a
+        // format suffix turns the variable's number into text that can be compared.
+        const std::string& reference = other.string();
+        const std::string asText = reference.find('%') == std::string::npos
+                                       ? reference.substr(0, reference.size() - 1) + "%d}"
+                                       : reference;
         add(Severity::kWarning, Indexed(Join(path, "operands"), i + 1),
-            "the text \"%s\" never equals a number; write <integer>%s</integer> (or <real>) when "
-            "%s holds one",
-            text.c_str(), text.c_str(), other.string().c_str());
+            "the text \"%s\" never equals a number; when %s holds one, compare %s instead",
+            text.c_str(), reference.c_str(), asText.c_str());
       }
     }
   }

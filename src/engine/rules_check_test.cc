@@ -43,8 +43,8 @@ TEST(RulesCheck, ReportsEachMistakeWithFileRuleAndKeyPath) {
       {R"({name = ban; eventTypes = (a); criterion = ({operator = equal;});})",
        R"(criterion[1].operands: no operands for operator "equal"; the criterion always fails)"},
       {R"({name = ban; eventTypes = (a); criterion = ({operator = equal; operands = ("${count}", "5");});})",
-       "criterion[1].operands[2]: warning: the text \"5\" never equals a number; write "
-       "<integer>5</integer> (or <real>) when ${count} holds one"},
+       "criterion[1].operands[2]: warning: the text \"5\" never equals a number; when ${count} "
+       "holds one, compare ${count%d} instead"},
       {R"({name = ban; eventTypes = (a); variables = {x = "${a";};})",
        R"(variables.x: unterminated "${" at index 0; the substitution fails)"},
       {R"({name = ban; eventTypes = (a); variables = {x = "${globl:a}";};})",
