@@ -2,8 +2,10 @@
 // the daemon's own loader and engine.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "harness.h"
@@ -109,6 +111,56 @@ TEST(AdminTest, TestShowsWhatARuleWouldDoAndDoesNothing) {
   EXPECT_THAT(skipped.out, HasSubstr("  criterion: 0 (integer) greaterthan 1 (string): failed\n"
                                      "  does not fire\n"));
   EXPECT_THAT(skipped.out, Not(HasSubstr("action")));
+}
+
+}  // namespace
+}  // namespace tarvod::testing
+
+namespace tarvod::testing {
+namespace {
+
+TEST(AdminTest, StatsCountWhatWasSentAndAnswerRootOnly) {
+  TempDir dir;
+  const std::string errorLog = dir.file("error.log");
+  const std::string socket = dir.file("evtq");
+  const std::string config =
+      dir.write("tarvod.plist", ConfigPlist({{"errorLogPath", Str(errorLog)},
+                                             {"structuredLogPath", Str(dir.file("records.jsonl"))},
+                                             {"eventSocketPath", Str(socket)},
+                                             {"stateDirectory", Str(dir.path())}}));
+  const std::string rules = dir.write(
+      "rules.plist", RulesDocument({RuleXml(
+                         "odd", {"auth.failure"},
+                         {{"criterion", Arr({Criterion("equal", {Str("${event:n}"), Str("1")})})},
+                          {"actions", Arr({FileLog("x", dir.file("missing/x.log"))})}})}));
+  Daemon daemon({"-c", config, "-r", rules, "-n", "-v", "1"}, dir);
+  ASSERT_TRUE(daemon.waitForStartup(errorLog)) << daemon.stderrText();
+  for (const char* n : {"1", "2", "1"}) {
+    ASSERT_EQ(Tarvodctl({"-c", config, "send", "auth.failure.ssh", std::string("n=") + n}).status,
+              0);
+  }
+  ASSERT_TRUE(daemon.waitForLine(errorLog, "LOG: Cannot open"));
+  RunResult stats;
+  for (int i = 0; i < 50; ++i) {
+    stats = Tarvodctl({"-c", config, "stats"});
+    if (stats.out.find("\"run\": 2") != std::string::npos) break;
+    std::this_thread::sleep_for(100ms);
+  }
+  EXPECT_EQ(stats.status, 0) << stats.err;
+  EXPECT_THAT(stats.out, HasSubstr("\"rulesLoaded\": 1,"));
+  EXPECT_THAT(stats.out, HasSubstr("\"auth.failure\": 3"));
+  EXPECT_THAT(stats.out, HasSubstr("{\"name\": \"odd\", \"file\": \"" + rules +
+                                   "\", \"runs\": 3, \"fired\": 2,"));
+  EXPECT_THAT(stats.out, HasSubstr("\"log\": {\"run\": 2, \"failed\": 2}"));
+  EXPECT_THAT(Tarvodctl({"-c", config, "status"}).out, HasSubstr(" 1 rules loaded, "));
+
+  // Anyone else is turned away, by the socket's mode and by the daemon. (Root can be anyone.)
+  if (geteuid() != 0) return;
+  const RunResult other = RunProgram({"/usr/bin/setpriv", "--reuid=65534", "--regid=65534",
+                                      "--clear-groups", TarvodctlBinary(), "-c", config, "stats"});
+  EXPECT_EQ(other.status, 1);
+  EXPECT_THAT(other.err, HasSubstr("Permission denied"));
+  EXPECT_EQ(daemon.stop(), 0);
 }
 
 }  // namespace

@@ -1,7 +1,11 @@
 // tarvodctl: sends an event to a running tarvod over its event socket, posts a distributed
-// notification on the system bus, and edits the keychain store that "keychain:" references
-// read.
+// notification on the system bus, edits the keychain store that "keychain:" references read,
+// checks rules and tests them against an event with the daemon's own loader and engine, and
+// asks the running daemon for its counters over its root-only control socket.
 //
+//   tarvodctl [-c CONFIG] check [-r RULES] [--strict] [--json]
+//   tarvodctl [-c CONFIG] test [-r RULES] TYPE [key=value ...] | --plist FILE
+//   tarvodctl [-c CONFIG] stats|status [--socket PATH]
 //   tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]
 //   tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE
 //   tarvodctl post NAME OBJECT [key=value ...]
@@ -31,6 +35,7 @@
 #include <vector>
 
 #include "context/keychain.h"
+#include "platform/control_socket.h"
 #include "platform/files.h"
 #include "platform/notification_center.h"
 #include "platform/secret_file.h"
@@ -52,6 +57,7 @@ int Usage(FILE* out = stderr) {
                "usage: tarvodctl [-c CONFIG] check [-r RULES] [--strict] [--json]\n"
                "       tarvodctl [-c CONFIG] test [-r RULES] TYPE [key=value ...]\n"
                "       tarvodctl [-c CONFIG] test [-r RULES] --plist FILE\n"
+               "       tarvodctl [-c CONFIG] stats|status [--socket PATH]\n"
                "       tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]\n"
                "       tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE\n"
                "       tarvodctl post NAME OBJECT [key=value ...]\n"
@@ -101,7 +107,7 @@ bool Parse(const std::vector<std::string>& args, Command& command) {
     } else if (arg == "-c" || arg == "--socket" || arg == "--plist" || arg.starts_with("-")) {
       return false;
     } else if (command.verb.empty()) {
-      if (arg != "send" && arg != "post") return false;
+      if (arg != "send" && arg != "post" && arg != "stats" && arg != "status") return false;
       command.verb = arg;
     } else if (arg.find('=') == std::string::npos && command.pairs.empty()) {
       command.names.push_back(arg);
@@ -114,6 +120,9 @@ bool Parse(const std::vector<std::string>& args, Command& command) {
   // Pairs only without --plist; post: NAME OBJECT and no socket; send: TYPE or --plist.
   if (command.plistPath && !command.pairs.empty()) return false;
   if (command.verb == "post") return command.names.size() == 2 && !command.socketPath;
+  if (command.verb == "stats" || command.verb == "status") {
+    return command.names.empty() && command.pairs.empty() && !command.plistPath;
+  }
   return command.verb == "send" && command.names.size() == (command.plistPath ? 0u : 1u);
 }
 
@@ -315,6 +324,20 @@ int main(int argc, char** argv) {
   }
   Command command;
   if (!Parse(args, command)) return Usage();
+  if (command.verb == "stats" || command.verb == "status") {
+    // Beside the event socket; root's alone.
+    const std::string eventSocket =
+        command.socketPath ? *command.socketPath
+                           : ConfigurationPath(command.configurationPath, "eventSocketPath",
+                                               tarvod::kDefaultEventSocketPath);
+    std::string error;
+    const std::optional<std::string> answer =
+        tarvod::AskControlSocket(tarvod::ControlSocketPath(eventSocket), command.verb, &error);
+    if (!answer) return Fail("no answer from tarvod: " + error);
+    if (answer->starts_with("refused")) return Fail(*answer);
+    std::fputs(answer->c_str(), stdout);
+    return 0;
+  }
 
   plist::Dictionary message;
   if (command.plistPath) {

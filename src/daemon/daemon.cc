@@ -70,6 +70,7 @@ Daemon::Daemon(const Clock& clock, Files& files) : mClock(clock), mFiles(files) 
 
 Daemon::~Daemon() {
   // The sources go first: they dispatch into the engine until their thread is joined.
+  mControl.reset();
   mRunningTimers.clear();
   mMonitor.reset();
   mEngine.reset();
@@ -126,6 +127,7 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   size_t ruleCount = 0;
   mEngine->swapRulebase(LoadRulesReporting(*mEngine, mConfigurationPath, mRulesPath, &ruleCount));
   LogMessage(1, "Loaded %zu rules\n", ruleCount);
+  mFigures.rulesLoaded = ruleCount;
   if (ruleCount == 0) {
     LogMessage(0, "No rules found in %s, quitting....", mRulesPath.c_str());
     LogMessage(0, "Velkin Shutdown at %s", LocalDateText(mClock).c_str());
@@ -156,10 +158,25 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   }
   const int registered = RegisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
   mMonitor->beginListening();
+  StartControlSocket();
   LogMessage(1, "Registered %d events", registered);
   EnableCompanionLogJob();
   NotifyServiceManager("READY=1");
   return std::nullopt;
+}
+
+void Daemon::StartControlSocket() {
+  mFigures.startedAt = mClock.monotonic();
+  const std::string path = ControlSocketPath(
+      ConfigurationString(mConfiguration, "eventSocketPath", kDefaultEventSocketPath));
+  std::string error;
+  mControl = ControlSocket::Start(
+      path,
+      [this](const std::string& request) {
+        return ControlAnswer(request, mFigures, *mEngine, mMonitor.get());
+      },
+      &error);
+  if (!mControl) LogMessage(0, "The control socket is not available: %s", error.c_str());
 }
 
 void Daemon::runMainLoop() {
@@ -199,6 +216,8 @@ void Daemon::ReloadRules() {
   size_t ruleCount = 0;
   RulebasePtr rulebase = LoadRulesReporting(*mEngine, mConfigurationPath, mRulesPath, &ruleCount);
   LogMessage(1, "Loaded %zu rules\n", ruleCount);
+  mFigures.rulesLoaded = ruleCount;
+  mFigures.lastReload = mClock.now();
   mEngine->swapRulebase(std::move(rulebase));
   mEngine->postStartupEvent(true);
   mRunningTimers = CreatePeriodicEvents(mConfiguration, *mMonitor, *mMainLoop, mClock);
@@ -212,6 +231,7 @@ void Daemon::Shutdown() {
   CancelPeriodicEvents(mRunningTimers);
   mEngine->postShutdownEvent();
   UnregisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
+  mControl.reset();
   mMonitor->stopListening();
   mEngine->closeDispatch();
 

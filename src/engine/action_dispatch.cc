@@ -8,6 +8,7 @@
 #include "actions/run_command_action.h"
 #include "engine/keyword_tables.h"
 #include "engine/rule_processor.h"
+#include "engine/stats.h"
 #include "platform/diagnostic_log.h"
 
 namespace tarvod {
@@ -78,7 +79,9 @@ void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Conte
     dryRun->note("  action %s: %s", written.c_str(),
                  described ? described->c_str() : "fails (see the message above)");
   } else if (handler) {
+    const uint64_t problems = RuleProblemCount();
     handler->perform(action, rule, context);
+    Statistics().actionRan(code, RuleProblemCount() != problems);
   }
   LogMessage(2, "%s", "");
 }

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <filesystem>
 #include <memory>
 #include <string>
@@ -14,6 +15,7 @@
 #include "engine/keyword_tables.h"
 #include "engine/rule_processor.h"
 #include "engine/rules_loader.h"
+#include "engine/stats.h"
 #include "platform/diagnostic_log.h"
 
 namespace tarvod {
@@ -64,7 +66,13 @@ void QueuePrefix(SerialQueue& queue, double now, std::string_view prefix,
   auto fired = std::make_shared<std::atomic<bool>>(false);
   for (const RulePtr& rule : rules) {
     queue.async([rule, context, fired, dryRun] {
-      if (ProcessRule(*rule, *context, dryRun)) fired->store(true);
+      const auto start = std::chrono::steady_clock::now();
+      const bool didFire = ProcessRule(*rule, *context, dryRun);
+      if (didFire) fired->store(true);
+      if (dryRun == nullptr) {
+        const std::chrono::duration<double> spent = std::chrono::steady_clock::now() - start;
+        Statistics().ruleRan(*rule, didFire, spent.count());
+      }
     });
   }
   if (dryRun) return;
@@ -131,7 +139,10 @@ void Engine::dispatch(const plist::Dictionary& event, DryRun* dryRun) {
                type.size(), components, kMaxEventTypeBytes, kMaxEventTypeComponents);
     return;
   }
-  if (dryRun == nullptr) LogEvent(event);
+  if (dryRun == nullptr) {
+    LogEvent(event);
+    Statistics().eventDispatched();
+  }
   LogMessage(1, "EVENT RECEIVED: %s", type.c_str());
 
   const RulebasePtr rulebase = this->rulebase();
@@ -196,6 +207,7 @@ void Engine::swapRulebase(RulebasePtr rulebase) {
   // The previous generation is released outside the lock: freeing a large rulebase must not
   // hold up dispatching threads.
   mPreviousRulebase = std::move(replaced);
+  Statistics().forgetRules();
 }
 
 bool Engine::withVariables(const std::function<void(VariableStore&)>& work) {

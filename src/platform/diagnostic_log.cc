@@ -137,6 +137,7 @@ namespace {
 // The rule this thread is running, while a RuleMessageScope is open.
 thread_local const std::string* tRuleName = nullptr;
 thread_local const std::string* tRuleFile = nullptr;
+thread_local uint64_t tRuleProblems = 0;
 
 // Problems raised while a rule runs are written at these levels; traces use the higher ones.
 constexpr int64_t kHighestRuleProblemLevel = 1;
@@ -154,7 +155,10 @@ RuleMessageScope::~RuleMessageScope() {
   tRuleFile = mFile;
 }
 
+uint64_t RuleProblemCount() { return tRuleProblems; }
+
 void LogMessage(int64_t level, const char* format, ...) {
+  if (tRuleName != nullptr && level <= kHighestRuleProblemLevel) ++tRuleProblems;
   if (level > gDebugLevel.load(std::memory_order_relaxed)) return;
   ErrorLog& log = gErrorLog;
   std::lock_guard<std::mutex> lock(log.mLock);

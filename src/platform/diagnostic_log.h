@@ -27,6 +27,10 @@ inline constexpr size_t kMaxLogMessageBytes = 2047;
 // problems; traces are written at 2 and above) end with ` (rule "NAME" in FILE)`.
 void LogMessage(int64_t level, const char* format, ...) __attribute__((format(printf, 2, 3)));
 
+// How many problem lines (levels 0 and 1, written or not) the calling thread has raised under
+// a RuleMessageScope: an action that raised one has failed.
+uint64_t RuleProblemCount();
+
 // Names the rule the calling thread runs in its problem messages until destroyed; scopes nest.
 // name and file must outlive the scope.
 class RuleMessageScope {

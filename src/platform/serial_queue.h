@@ -42,6 +42,8 @@ class SerialQueue {
 
   // Jobs submitted and not yet finished (the one running included).
   size_t pending() const;
+  // The most jobs ever pending at once.
+  size_t highWater() const;
   // Blocks the caller until at most limit jobs are pending.
   void waitUntilPendingAtMost(size_t limit);
   // A non-blocking eventfd that becomes readable once at most limit jobs are pending, after
@@ -79,6 +81,7 @@ class SerialQueue {
   std::condition_variable mProgress;
   std::deque<std::function<void()>> mJobs;
   size_t mPending = 0;
+  size_t mHighWater = 0;
   bool mStopping = false;
   bool mAbandoned = false;
   size_t mSignalLimit = 0;

@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <chrono>
 #include <vector>
 
 #include "platform/diagnostic_log.h"
@@ -11,6 +12,13 @@
 #include "sources/ssh_journal.h"
 
 namespace tarvod {
+namespace {
+
+double MonotonicSeconds() {
+  return std::chrono::duration<double>(std::chrono::steady_clock::now().time_since_epoch()).count();
+}
+
+}  // namespace
 namespace {
 
 constexpr const char* kInputQueueLabel = "com.quenta.tarvod.inputq";
@@ -155,7 +163,18 @@ void Monitor::applyBackPressure() {
   if (!mHooks.backlog || !mProgressSource || !mInputEvtQ->isCurrentThread()) return;
   if (!mInputEvtQ->readGateOpen() || mHooks.backlog() <= kBackPressureHighJobs) return;
   mInputEvtQ->setReadGateOpen(false);
+  mPauses.fetch_add(1, std::memory_order_relaxed);
+  mPausedSince.store(MonotonicSeconds(), std::memory_order_relaxed);
   mHooks.signalWhenBacklogAtMost(kBackPressureLowJobs);
+}
+
+Monitor::BackPressure Monitor::backPressure() const {
+  BackPressure result{mPauses.load(std::memory_order_relaxed),
+                      mPausedSeconds.load(std::memory_order_relaxed)};
+  if (const double since = mPausedSince.load(std::memory_order_relaxed); since > 0) {
+    result.seconds += MonotonicSeconds() - since;
+  }
+  return result;
 }
 
 void Monitor::onBacklogProgress() {
@@ -164,6 +183,12 @@ void Monitor::onBacklogProgress() {
   if (mInputEvtQ->readGateOpen()) return;
   if (mHooks.backlog() <= kBackPressureLowJobs) {
     mInputEvtQ->setReadGateOpen(true);
+    const double since = mPausedSince.exchange(0, std::memory_order_relaxed);
+    if (since > 0) {
+      mPausedSeconds.store(
+          mPausedSeconds.load(std::memory_order_relaxed) + MonotonicSeconds() - since,
+          std::memory_order_relaxed);
+    }
   } else {
     mHooks.signalWhenBacklogAtMost(kBackPressureLowJobs);
   }

@@ -6,6 +6,7 @@
 // filterBySourceUID, applyBackPressure. Any thread: processEvent.
 #pragma once
 
+#include <atomic>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -114,9 +115,20 @@ class Monitor {
   void applyBackPressure();
   // The input queue; nullptr before the first beginListening.
   EventLoop* inputQueue() const { return mInputEvtQ.get(); }
+  // How often the read gate was closed, and for how long in all (the pause under way
+  // included). Any thread.
+  struct BackPressure {
+    uint64_t pauses = 0;
+    double seconds = 0;
+  };
+  BackPressure backPressure() const;
 
  private:
   void onBacklogProgress();
+
+  std::atomic<uint64_t> mPauses{0};
+  std::atomic<double> mPausedSeconds{0};  // of the pauses that ended
+  std::atomic<double> mPausedSince{0};    // monotonic seconds; 0 while the gate is open
 
   std::unique_ptr<EventListener> mXPCEventConnection;
   std::unique_ptr<EventLoop> mInputEvtQ;
