@@ -154,6 +154,16 @@ TEST(AdminTest, StatsCountWhatWasSentAndAnswerRootOnly) {
   EXPECT_THAT(stats.out, HasSubstr("\"log\": {\"run\": 2, \"failed\": 2}"));
   EXPECT_THAT(Tarvodctl({"-c", config, "status"}).out, HasSubstr(" 1 rules loaded, "));
 
+  // A second daemon on the same socket says so on standard error.
+  Daemon second({"-c", config, "-r", rules, "-n"}, dir);
+  const std::string held =
+      "tarvod: the event socket cannot be opened: another process listens on " + socket;
+  for (int i = 0; i < 100 && second.stderrText().find(held) == std::string::npos; ++i) {
+    std::this_thread::sleep_for(50ms);
+  }
+  EXPECT_THAT(second.stderrText(), HasSubstr(held));
+  EXPECT_EQ(second.stop(), 0);
+
   // Anyone else is turned away, by the socket's mode and by the daemon. (Root can be anyone.)
   if (geteuid() != 0) return;
   const RunResult other = RunProgram({"/usr/bin/setpriv", "--reuid=65534", "--regid=65534",

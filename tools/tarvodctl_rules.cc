@@ -3,8 +3,10 @@
 #include <unistd.h>
 
 #include <cstdio>
+#include <memory>
 #include <optional>
 
+#include "context/keychain.h"
 #include "daemon/configuration.h"
 #include "engine/engine.h"
 #include "platform/clock.h"
@@ -88,6 +90,18 @@ void PrintJson(const tarvod::LoadReport& report, size_t errors, size_t warnings)
   std::printf("%s]}\n", report.problems.empty() ? "" : "\n");
 }
 
+// An engine with the configuration's initial globals and keychain store, as the daemon starts
+// with them (the store is readable by root only; for others keychain references stay empty).
+std::unique_ptr<tarvod::Engine> EngineAsTheDaemonHasIt(const std::string& configurationPath) {
+  plist::Dictionary globals;
+  plist::Dictionary configuration;
+  tarvod::LoadConfiguration(configurationPath, &globals, &configuration);
+  auto engine = std::make_unique<tarvod::Engine>(tarvod::Clock::System(), std::move(globals));
+  engine->setKeychain(std::make_shared<tarvod::Keychain>(
+      tarvod::ConfigurationString(configuration, "keychainPath", tarvod::kDefaultKeychainPath)));
+  return engine;
+}
+
 }  // namespace
 
 int RunCheck(const std::vector<std::string>& args, const std::string& configurationPath) {
@@ -96,12 +110,10 @@ int RunCheck(const std::vector<std::string>& args, const std::string& configurat
 
   tarvod::LoadReport report;
   tarvod::CheckConfiguration(configurationPath, report.problems);
-  plist::Dictionary globals;
-  tarvod::LoadConfiguration(configurationPath, &globals, nullptr);
   // The daemon's own loader, on an engine of its own: nothing running is touched.
-  tarvod::Engine engine(tarvod::Clock::System(), std::move(globals));
+  const std::unique_ptr<tarvod::Engine> engine = EngineAsTheDaemonHasIt(configurationPath);
   size_t count = 0;
-  engine.loadRules(options.rulesPath, &count, &report);
+  engine->loadRules(options.rulesPath, &count, &report);
   if (count == 0) {
     report.add(tarvod::FileProblem(options.rulesPath,
                                    "no rules loaded; the daemon would quit at startup"));
@@ -150,9 +162,8 @@ int RunTest(const std::vector<std::string>& args, const std::string& configurati
   // The problems the rules run into (a substitution that fails, an unknown user) are the
   // daemon's level-0 messages: they go to standard error.
   tarvod::AttachErrorLog(dup(STDERR_FILENO));
-  plist::Dictionary globals;
-  tarvod::LoadConfiguration(configurationPath, &globals, nullptr);
-  tarvod::Engine engine(tarvod::Clock::System(), std::move(globals));
+  const std::unique_ptr<tarvod::Engine> enginePointer = EngineAsTheDaemonHasIt(configurationPath);
+  tarvod::Engine& engine = *enginePointer;
   size_t count = 0;
   engine.swapRulebase(engine.loadRules(options.rulesPath, &count));
   if (count == 0) {
