@@ -149,6 +149,8 @@ TEST(AdminTest, StatsCountWhatWasSentAndAnswerRootOnly) {
   EXPECT_EQ(stats.status, 0) << stats.err;
   EXPECT_THAT(stats.out, HasSubstr("\"rulesLoaded\": 1,"));
   EXPECT_THAT(stats.out, HasSubstr("\"auth.failure\": 3"));
+  EXPECT_THAT(stats.out, HasSubstr("\"eventsPerSource\": {\"socket\": 3, \"sshLogins\": 0, "
+                                   "\"notifications\": 0, \"periodic\": 0, \"daemon\": 1}"));
   EXPECT_THAT(stats.out, HasSubstr("{\"name\": \"odd\", \"file\": \"" + rules +
                                    "\", \"runs\": 3, \"fired\": 2,"));
   EXPECT_THAT(stats.out, HasSubstr("\"log\": {\"run\": 2, \"failed\": 2}"));

@@ -46,6 +46,24 @@ std::string Number(double value) {
   return buffer;
 }
 
+// The daemon's own events (startup, reload, shutdown) are the ones no source delivered.
+std::string PerSource(const Monitor* monitor) {
+  using Source = Monitor::EventSource;
+  constexpr std::pair<Source, const char*> kSources[] = {{Source::kSocket, "socket"},
+                                                         {Source::kSshLogins, "sshLogins"},
+                                                         {Source::kNotifications, "notifications"},
+                                                         {Source::kPeriodic, "periodic"}};
+  std::string out = "{";
+  uint64_t delivered = 0;
+  for (const auto& [source, name] : kSources) {
+    const uint64_t count = monitor ? monitor->eventsFrom(source) : 0;
+    delivered += count;
+    out += "\"" + std::string(name) + "\": " + std::to_string(count) + ", ";
+  }
+  const uint64_t all = Statistics().events();
+  return out + "\"daemon\": " + std::to_string(all > delivered ? all - delivered : 0) + "}";
+}
+
 std::string Stats(const DaemonFigures& figures, Engine& engine, const Monitor* monitor) {
   const double lastReload = figures.lastReload.load();
   std::string out = "{\n  \"uptime\": " + Number(MonotonicNow() - figures.startedAt) +
@@ -54,6 +72,7 @@ std::string Stats(const DaemonFigures& figures, Engine& engine, const Monitor* m
                     (lastReload > 0 ? Json(plist::FormatDate(plist::Date{lastReload}, false))
                                     : std::string("null")) +
                     ",\n  \"events\": " + std::to_string(Statistics().events()) +
+                    ",\n  \"eventsPerSource\": " + PerSource(monitor) +
                     ",\n  \"eventsPerTypePrefix\": {";
   const char* separator = "";
   // Counted since the rules were last loaded.

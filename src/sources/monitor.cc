@@ -68,8 +68,9 @@ bool Monitor::filterBySourceUID(uint32_t uid, uint32_t gid) const {
   return false;
 }
 
-void Monitor::processEvent(const plist::Dictionary& event) {
+void Monitor::processEvent(const plist::Dictionary& event, EventSource source) {
   if (DebugLevel() >= 3) LogMessage(3, "Event received: %s ", plist::Describe(event).c_str());
+  countEvent(source);
   if (mHooks.dispatch) mHooks.dispatch(event);
 }
 

@@ -6,6 +6,7 @@
 // filterBySourceUID, applyBackPressure. Any thread: processEvent.
 #pragma once
 
+#include <array>
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
@@ -93,7 +94,9 @@ class Monitor {
   // A blocking reader of mAuditpipe that the daemon does not use; returns the error number
   // that ended it, or -1 when it could not start.
   int runAuditpipeListener();
-  void processEvent(const plist::Dictionary& event);
+  // Where events come from, as `tarvodctl stats` counts them.
+  enum class EventSource { kSocket, kSshLogins, kNotifications, kPeriodic, kCount };
+  void processEvent(const plist::Dictionary& event, EventSource source = EventSource::kSocket);
   // A notification observed for an event type (notifications.cc): its user information is
   // the event, an absent one an empty event.
   void processNotification(const Notification& notification);
@@ -122,10 +125,19 @@ class Monitor {
     double seconds = 0;
   };
   BackPressure backPressure() const;
+  // Events handed to the engine from one source. Any thread.
+  uint64_t eventsFrom(EventSource source) const {
+    return mEventsFrom[static_cast<size_t>(source)].load(std::memory_order_relaxed);
+  }
 
  private:
   void onBacklogProgress();
 
+  void countEvent(EventSource source) {
+    mEventsFrom[static_cast<size_t>(source)].fetch_add(1, std::memory_order_relaxed);
+  }
+
+  std::array<std::atomic<uint64_t>, static_cast<size_t>(EventSource::kCount)> mEventsFrom{};
   std::atomic<uint64_t> mPauses{0};
   std::atomic<double> mPausedSeconds{0};  // of the pauses that ended
   std::atomic<double> mPausedSince{0};    // monotonic seconds; 0 while the gate is open
