@@ -15,7 +15,8 @@
 //   tarvodctl [-c CONFIG] keychain [--keychain PATH] list
 //
 // send with TYPE sends { eventType = TYPE; eventDetails = { key = value; ... }; }, with --plist
-// the dictionary in a property-list file. Without --socket the path is the configuration
+// the dictionary in a property-list file; either is stamped with eventTimestamp (now, in
+// seconds since 2001) unless it has one. Without --socket the path is the configuration
 // file's eventSocketPath (default configuration /etc/tarvod.d/tarvod.plist), else the
 // daemon's default. post posts the notification NAME with object OBJECT; its user information
 // is { eventType = OBJECT; eventDetails = { key = value; ... }; }, the event the daemon's rules
@@ -35,6 +36,7 @@
 #include <vector>
 
 #include "context/keychain.h"
+#include "platform/clock.h"
 #include "platform/control_socket.h"
 #include "platform/files.h"
 #include "platform/notification_center.h"
@@ -363,6 +365,10 @@ int main(int argc, char** argv) {
     return 0;
   }
 
+  // Stamped as the daemon's own events are, in seconds since 2001, unless the sender did.
+  if (!message.contains("eventTimestamp")) {
+    message.set("eventTimestamp", plist::Value::Real(tarvod::Clock::System().now()));
+  }
   const std::optional<std::string> bytes = plist::WriteXmlPropertyList(message);
   if (!bytes) return Fail("the message cannot be written as a property list");
   if (bytes->size() > tarvod::kMaxEventMessageBytes) {
