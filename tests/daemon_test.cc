@@ -152,11 +152,17 @@ TEST_F(DaemonTest, RulesTreeLoadsEveryRulesFileAtAnyDepth) {
   // one are not.
   EXPECT_THAT(log, HasSubstr("Loaded 7 rules\n"));
   // Only the string among oddTypes' types indexes it; each other entry is named and skipped.
-  EXPECT_THAT(log, HasSubstr("  Skipping event type 5 of rule oddTypes: not a string\n"));
+  const std::string mixed = dir.file("tree/mixed.plist");
+  EXPECT_THAT(log, HasSubstr(mixed + ": rule 6 \"oddTypes\": eventTypes[1]: must be a string, "
+                                     "not an integer\n"));
+  EXPECT_THAT(log, HasSubstr(mixed + ": rule 3: must be a dictionary, not a string; skipped\n"));
+  EXPECT_THAT(log, HasSubstr(dir.file("tree/dict.plist") +
+                             ": the top level is not an array of rules; skipped\n"));
+  EXPECT_THAT(log, HasSubstr("5 files read, 7 rules loaded, 2 files skipped, 8 problems found\n"));
   EXPECT_EQ(log.find("  Added rule: oddTypes\n"), log.rfind("  Added rule: oddTypes\n"));
   EXPECT_NE(log.find("  Added rule: oddTypes\n"), std::string::npos);
   EXPECT_THAT(log, HasSubstr("  Skipping disabled rule: disabled\n"));
-  EXPECT_THAT(log, Not(HasSubstr("stringTypes")));
+  EXPECT_THAT(log, Not(HasSubstr("Added rule: stringTypes")));
   EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("tree/notes.txt"))));
   EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("tree/dict.plist"))));
   EXPECT_THAT(log, HasSubstr("  Added rule: twice\n  Added rule: twice\n"));
@@ -174,11 +180,15 @@ TEST_F(DaemonTest, SingleRulesFileIsChosenByItsExtension) {
   const std::string log = ReadFile(errorLog());
   EXPECT_EQ(log.substr(log.rfind('\n', log.size() - 2) + 1).rfind("Velkin Shutdown at ", 0), 0u);
 
-  // A directory whose name has an extension is read as a single file: no rules.
-  mkdir(dir.file("my.rules").c_str(), 0755);
-  dir.write("my.rules/a.plist", RulesDocument({RuleXml("r", "<array><string>x</string></array>")}));
-  EXPECT_EQ(run({"-c", config, "-r", dir.file("my.rules")}).status, 0);
-  EXPECT_THAT(ReadFile(errorLog()), HasSubstr("No rules found in " + dir.file("my.rules")));
+  // A directory is loaded as a directory even when its name has an extension; leftovers of
+  // editors and package managers beside the rules are not loaded.
+  mkdir(dir.file("rules.d").c_str(), 0755);
+  dir.write("rules.d/a.plist", RulesDocument({RuleXml("r", "<array><string>x</string></array>")}));
+  dir.write("rules.d/a.plist.dpkg-old",
+            RulesDocument({RuleXml("old", "<array><string>x</string></array>")}));
+  Daemon second({"-c", config, "-r", dir.file("rules.d"), "-v", "1"}, dir);
+  ASSERT_TRUE(second.waitForLine(errorLog(), "1 rules loaded, 1 files skipped"));
+  EXPECT_EQ(second.stop(SIGTERM), 0);
 }
 
 TEST_F(DaemonTest, SigusrOneIsIgnored) {

@@ -158,7 +158,8 @@ TEST(Load, AFloodOfOneFailureLeavesAFewLinesWhoseCountsAddUp) {
     const auto countsAddUp = [&] {
       const std::string log = ReadFile(errorLog);
       for (const char* which : {"a", "b"}) {
-        const std::string line = "LOG: Cannot open " + dir.file("missing/") + which + " errno = 2";
+        const std::string line = "LOG: Cannot open " + dir.file("missing/") + which +
+                                 " errno = 2 (rule \"flood\" in " + rules + ")";
         const LineCount count = CountLogLine(log, line);
         if (count.written + count.repeated != static_cast<size_t>(c.events / 2)) return false;
         if (c.repeatInterval == 0 && count.written != static_cast<size_t>(c.events / 2)) {

@@ -269,8 +269,9 @@ TEST_F(RunCommandTest, ATimeLimitEndsTheProgramAndEverythingItStarted) {
                                    {{"commandTimeout", Int(1)}});
   const auto elapsed = std::chrono::steady_clock::now() - before;
   EXPECT_LT(elapsed, 20s);
-  EXPECT_THAT(log, HasSubstr("DoRunAction: /bin/sleep still running after 0.5 seconds; ending its"
-                             " process group (SIGTERM, SIGKILL 2 seconds later)\n"));
+  EXPECT_THAT(
+      log, HasSubstr("DoRunAction: /bin/sleep still running after 0.5 seconds; ending its"
+                     " process group (SIGTERM, SIGKILL 2 seconds later) (rule \"commands\" in "));
   EXPECT_THAT(log, HasSubstr("DoRunAction: /bin/sleep exited with status 143\n"));
   EXPECT_THAT(log, HasSubstr("DoRunAction: /bin/sh still running after 1 seconds"));
   EXPECT_THAT(log, HasSubstr("DoRunAction: /bin/sh exited with status 137\n"));

@@ -1,7 +1,11 @@
 // tarvodctl: sends an event to a running tarvod over its event socket, posts a distributed
-// notification on the system bus, and edits the keychain store that "keychain:" references
-// read.
+// notification on the system bus, edits the keychain store that "keychain:" references read,
+// checks rules and tests them against an event with the daemon's own loader and engine, and
+// asks the running daemon for its counters over its root-only control socket.
 //
+//   tarvodctl [-c CONFIG] check [-r RULES] [--strict] [--json]
+//   tarvodctl [-c CONFIG] test [-r RULES] TYPE [key=value ...] | --plist FILE
+//   tarvodctl [-c CONFIG] stats|status [--socket PATH]
 //   tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]
 //   tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE
 //   tarvodctl post NAME OBJECT [key=value ...]
@@ -11,7 +15,8 @@
 //   tarvodctl [-c CONFIG] keychain [--keychain PATH] list
 //
 // send with TYPE sends { eventType = TYPE; eventDetails = { key = value; ... }; }, with --plist
-// the dictionary in a property-list file. Without --socket the path is the configuration
+// the dictionary in a property-list file; either is stamped with eventTimestamp (now, in
+// seconds since 2001) unless it has one. Without --socket the path is the configuration
 // file's eventSocketPath (default configuration /etc/tarvod.d/tarvod.plist), else the
 // daemon's default. post posts the notification NAME with object OBJECT; its user information
 // is { eventType = OBJECT; eventDetails = { key = value; ... }; }, the event the daemon's rules
@@ -31,6 +36,8 @@
 #include <vector>
 
 #include "context/keychain.h"
+#include "platform/clock.h"
+#include "platform/control_socket.h"
 #include "platform/files.h"
 #include "platform/notification_center.h"
 #include "platform/secret_file.h"
@@ -38,6 +45,7 @@
 #include "plist/codec.h"
 #include "plist/value.h"
 #include "sources/event_listener.h"
+#include "tarvodctl_rules.h"
 
 namespace {
 
@@ -46,16 +54,20 @@ constexpr const char* kDefaultConfiguration = "/etc/tarvod.d/tarvod.plist";
 // A password longer than this is no password: set refuses it.
 constexpr size_t kMaxPasswordBytes = 64 * 1024;
 
-int Usage() {
-  std::fprintf(stderr,
-               "usage: tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]\n"
+int Usage(FILE* out = stderr) {
+  std::fprintf(out,
+               "usage: tarvodctl [-c CONFIG] check [-r RULES] [--strict] [--json]\n"
+               "       tarvodctl [-c CONFIG] test [-r RULES] TYPE [key=value ...]\n"
+               "       tarvodctl [-c CONFIG] test [-r RULES] --plist FILE\n"
+               "       tarvodctl [-c CONFIG] stats|status [--socket PATH]\n"
+               "       tarvodctl [-c CONFIG] send [--socket PATH] TYPE [key=value ...]\n"
                "       tarvodctl [-c CONFIG] send [--socket PATH] --plist FILE\n"
                "       tarvodctl post NAME OBJECT [key=value ...]\n"
                "       tarvodctl post --plist FILE NAME OBJECT\n"
                "       tarvodctl [-c CONFIG] keychain [--keychain PATH] set|get|delete SERVICE "
                "ACCOUNT\n"
                "       tarvodctl [-c CONFIG] keychain [--keychain PATH] list\n");
-  return 2;
+  return out == stderr ? 2 : 0;
 }
 
 int Fail(const std::string& message) {
@@ -97,7 +109,7 @@ bool Parse(const std::vector<std::string>& args, Command& command) {
     } else if (arg == "-c" || arg == "--socket" || arg == "--plist" || arg.starts_with("-")) {
       return false;
     } else if (command.verb.empty()) {
-      if (arg != "send" && arg != "post") return false;
+      if (arg != "send" && arg != "post" && arg != "stats" && arg != "status") return false;
       command.verb = arg;
     } else if (arg.find('=') == std::string::npos && command.pairs.empty()) {
       command.names.push_back(arg);
@@ -110,6 +122,9 @@ bool Parse(const std::vector<std::string>& args, Command& command) {
   // Pairs only without --plist; post: NAME OBJECT and no socket; send: TYPE or --plist.
   if (command.plistPath && !command.pairs.empty()) return false;
   if (command.verb == "post") return command.names.size() == 2 && !command.socketPath;
+  if (command.verb == "stats" || command.verb == "status") {
+    return command.names.empty() && command.pairs.empty() && !command.plistPath;
+  }
   return command.verb == "send" && command.names.size() == (command.plistPath ? 0u : 1u);
 }
 
@@ -285,6 +300,25 @@ bool IsKeychainCommand(const std::vector<std::string>& args) {
 
 int main(int argc, char** argv) {
   const std::vector<std::string> args(argv + 1, argv + argc);
+  if (!args.empty() && (args[0] == "--help" || args[0] == "-h")) return Usage(stdout);
+  // check and test: -c may stand before or after the command word.
+  for (size_t i = 0; i < args.size(); i += args[i] == "-c" ? 2 : 1) {
+    if (args[i] == "-c") continue;
+    if (args[i] != "check" && args[i] != "test") break;
+    std::string configurationPath = kDefaultConfiguration;
+    std::vector<std::string> rest;
+    for (size_t j = 0; j < args.size(); ++j) {
+      if (j == i) continue;
+      if (args[j] == "-c" && j + 1 < args.size()) {
+        configurationPath = args[++j];
+      } else {
+        rest.push_back(args[j]);
+      }
+    }
+    const int status =
+        args[i] == "check" ? RunCheck(rest, configurationPath) : RunTest(rest, configurationPath);
+    return status == 2 ? Usage() : status;
+  }
   if (IsKeychainCommand(args)) {
     KeychainCommand keychain;
     if (!ParseKeychain(args, keychain)) return Usage();
@@ -292,6 +326,20 @@ int main(int argc, char** argv) {
   }
   Command command;
   if (!Parse(args, command)) return Usage();
+  if (command.verb == "stats" || command.verb == "status") {
+    // Beside the event socket; root's alone.
+    const std::string eventSocket =
+        command.socketPath ? *command.socketPath
+                           : ConfigurationPath(command.configurationPath, "eventSocketPath",
+                                               tarvod::kDefaultEventSocketPath);
+    std::string error;
+    const std::optional<std::string> answer =
+        tarvod::AskControlSocket(tarvod::ControlSocketPath(eventSocket), command.verb, &error);
+    if (!answer) return Fail("no answer from tarvod: " + error);
+    if (answer->starts_with("refused")) return Fail(*answer);
+    std::fputs(answer->c_str(), stdout);
+    return 0;
+  }
 
   plist::Dictionary message;
   if (command.plistPath) {
@@ -317,6 +365,10 @@ int main(int argc, char** argv) {
     return 0;
   }
 
+  // Stamped as the daemon's own events are, in seconds since 2001, unless the sender did.
+  if (!message.contains("eventTimestamp")) {
+    message.set("eventTimestamp", plist::Value::Real(tarvod::Clock::System().now()));
+  }
   const std::optional<std::string> bytes = plist::WriteXmlPropertyList(message);
   if (!bytes) return Fail("the message cannot be written as a property list");
   if (bytes->size() > tarvod::kMaxEventMessageBytes) {

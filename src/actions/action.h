@@ -24,6 +24,14 @@ class Action {
   virtual ~Action() = default;
   virtual void perform(const plist::Dictionary& action, const FiredRule& rule,
                        Context& context) = 0;
+  // A dry run: resolves the action as perform would and says what it would do (the line, the
+  // command and user, the recipients) without doing it; nullopt when resolving failed (and was
+  // logged) so that perform would do nothing. Resolving may read the variable store but never
+  // changes it. A handler without its own description is only named.
+  virtual std::optional<std::string> describe(const plist::Dictionary& action,
+                                              const FiredRule& rule, Context& context) {
+    return std::string("would run (this action does not describe itself)");
+  }
 };
 
 // The text form of action[key] after substitution. The outer nullopt means "stop the action":

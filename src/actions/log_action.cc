@@ -277,21 +277,44 @@ void ReopenKeptLogFiles() { gReopenGeneration.fetch_add(1); }
 
 void EndLogBatch() { gBatch.fetch_add(1, std::memory_order_relaxed); }
 
-void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule, Context& context) {
+namespace {
+
+// What a log action writes: the message (empty: nothing), the lower-cased logType, the path.
+struct LogLine {
+  std::string message;
+  std::string type;
+  std::optional<std::string> path;
+};
+
+// nullopt when a substitution failed (logged): the action ends.
+std::optional<LogLine> ResolveLogLine(const plist::Dictionary& action, const FiredRule& rule,
+                                      Context& context) {
+  LogLine line;
   const auto resolvedMessage = ResolveActionText(action, "message", rule, context);
-  if (!resolvedMessage) return;
-  if (!*resolvedMessage || (*resolvedMessage)->empty()) return;
+  if (!resolvedMessage) return std::nullopt;
+  if (!*resolvedMessage || (*resolvedMessage)->empty()) return line;
   // A log line is no place for a secret: keychain values are written as the placeholder.
-  const std::string message = context.shownText(UnescapeColonsInString(**resolvedMessage));
-  if (message.empty()) return;
+  line.message = context.shownText(UnescapeColonsInString(**resolvedMessage));
+  if (line.message.empty()) return line;
 
   const auto logType = ResolveActionText(action, "logType", rule, context);
-  if (!logType) return;
-  const std::string type = *logType ? LowerCase(**logType) : std::string();
+  if (!logType) return std::nullopt;
+  line.type = *logType ? LowerCase(**logType) : std::string();
 
   // Resolved even for the structured log: an error in it ends the action either way.
   const auto logPath = ResolveActionText(action, "logPath", rule, context);
-  if (!logPath) return;
+  if (!logPath) return std::nullopt;
+  line.path = *logPath;
+  return line;
+}
+
+}  // namespace
+
+void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule, Context& context) {
+  const std::optional<LogLine> line = ResolveLogLine(action, rule, context);
+  if (!line || line->message.empty()) return;
+  const std::string& message = line->message;
+  const std::string& type = line->type;
 
   LogMessage(3, "DoLogAction: logMessage is [%s]", message.c_str());
 
@@ -299,14 +322,28 @@ void LogAction::perform(const plist::Dictionary& action, const FiredRule& rule, 
     LogToStructuredLog(action, type, message, rule, context);
     return;
   }
-  if (!*logPath) return;
+  if (!line->path) return;
   // A slow or stuck file must not keep shutdown from saving the store.
   SerialQueue::BlockingSection blocking;
   if (gKeepLogFilesOpen.load(std::memory_order_relaxed)) {
-    LogToKeptFile(**logPath, message);
+    LogToKeptFile(*line->path, message);
   } else {
-    LogToFile(**logPath, message);
+    LogToFile(*line->path, message);
   }
+}
+
+std::optional<std::string> LogAction::describe(const plist::Dictionary& action,
+                                               const FiredRule& rule, Context& context) {
+  const std::optional<LogLine> line = ResolveLogLine(action, rule, context);
+  if (!line) return std::nullopt;
+  if (line->message.empty()) return std::string("would log nothing: the message is empty");
+  if (line->type == "syslog" || line->type == "kvlog") {
+    const plist::Value* level = action.find("logLevel");
+    return "would send to the structured log (" + line->type + ", level " +
+           (level ? level->textForm() : std::string("notice")) + "): " + line->message;
+  }
+  if (!line->path) return std::string("would log nothing: no logPath");
+  return "would append to " + *line->path + ": " + line->message;
 }
 
 }  // namespace tarvod

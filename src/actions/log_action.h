@@ -10,6 +10,8 @@ namespace tarvod {
 class LogAction final : public Action {
  public:
   void perform(const plist::Dictionary& action, const FiredRule& rule, Context& context) override;
+  std::optional<std::string> describe(const plist::Dictionary& action, const FiredRule& rule,
+                                      Context& context) override;
 };
 // Builds the level-name table ("emergency" 0 to "debug" 7); later calls leave it as it is.
 void BuildLevelNameTable();

@@ -14,8 +14,14 @@ class PostNotificationAction final : public Action {
   // center must outlive the action.
   explicit PostNotificationAction(NotificationCenter& center) : mCenter(center) {}
   void perform(const plist::Dictionary& action, const FiredRule& rule, Context& context) override;
+  std::optional<std::string> describe(const plist::Dictionary& action, const FiredRule& rule,
+                                      Context& context) override;
 
  private:
+  // The notification perform posts; nullopt (logged) when there is none to post.
+  std::optional<Notification> resolve(const plist::Dictionary& action, const FiredRule& rule,
+                                      Context& context);
+
   NotificationCenter& mCenter;
 };
 

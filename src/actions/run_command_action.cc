@@ -80,14 +80,16 @@ Redirection Output(const std::string& path, const char* stream) {
 
 }  // namespace
 
-void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule& rule,
-                               Context& context) {
+std::optional<RunCommandAction::Resolved> RunCommandAction::resolve(const plist::Dictionary& action,
+                                                                    const FiredRule& rule,
+                                                                    Context& context) {
+  Resolved resolved;
   const auto command = ResolveActionText(action, "command", rule, context);
-  if (!command) return;
+  if (!command) return std::nullopt;
 
   const auto resolvedArguments = ResolveActionValue(action, "arguments", rule, context);
-  if (!resolvedArguments) return;
-  plist::Array arguments;
+  if (!resolvedArguments) return std::nullopt;
+  plist::Array& arguments = resolved.arguments;
   if (*resolvedArguments) {
     if ((*resolvedArguments)->isArray()) {
       arguments = (*resolvedArguments)->array();
@@ -97,25 +99,25 @@ void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule&
   }
 
   const auto workingDirectory = ResolveActionText(action, "workingDirectory", rule, context);
-  if (!workingDirectory) return;
+  if (!workingDirectory) return std::nullopt;
   const auto environment = ResolveActionValue(action, "environment", rule, context);
-  if (!environment) return;
+  if (!environment) return std::nullopt;
   std::optional<std::string> paths[3];
   const char* const pathKeys[3] = {"stdinPath", "stdoutPath", "stderrPath"};
   for (int i = 0; i < 3; ++i) {
     auto path = ResolveActionText(action, pathKeys[i], rule, context);
-    if (!path) return;
+    if (!path) return std::nullopt;
     paths[i] = *path;
   }
   const auto timeoutText = ResolveActionText(action, "timeout", rule, context);
-  if (!timeoutText) return;
+  if (!timeoutText) return std::nullopt;
 
   if (!*command) {
     LogMessage(0, "DoRunAction: No command to run. Aborting action");
-    return;
+    return std::nullopt;
   }
 
-  LaunchRequest request;
+  LaunchRequest& request = resolved.request;
   request.program = **command;
   request.arguments.push_back(**command);
   for (std::string& text : ArgumentTexts(arguments)) request.arguments.push_back(std::move(text));
@@ -140,7 +142,7 @@ void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule&
   } else {
     request.workingDirectory = "/";
   }
-  const double limit = TimeLimit(*timeoutText, mDefaultTimeout.load());
+  resolved.limit = TimeLimit(*timeoutText, mDefaultTimeout.load());
 
   // The directory service may be remote and the program may never end: nothing from here on
   // touches the variable store.
@@ -152,7 +154,7 @@ void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule&
     const std::optional<UserRecord> record = LookUpUser(*userName);
     if (!record) {
       LogMessage(0, "DoRunAction: User '%s' not found. Aborting action", userName->c_str());
-      return;
+      return std::nullopt;
     }
     identity.uid = record->uid;
   }
@@ -161,7 +163,7 @@ void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule&
     const std::optional<gid_t> gid = LookUpGroupID(groupName);
     if (!gid) {
       LogMessage(0, "DoRunAction: Group '%s' not found. Aborting action", groupName.c_str());
-      return;
+      return std::nullopt;
     }
     identity.gid = *gid;
   }
@@ -172,7 +174,7 @@ void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule&
     if (identity.groups.empty()) {
       LogMessage(0, "DoRunAction: Groups of user '%s' not found. Aborting action",
                  userName->c_str());
-      return;
+      return std::nullopt;
     }
   } else {
     identity.groups = {identity.gid};
@@ -183,6 +185,29 @@ void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule&
                    true};
   request.identity = std::move(identity);
 
+  return resolved;
+}
+
+std::optional<std::string> RunCommandAction::describe(const plist::Dictionary& action,
+                                                      const FiredRule& rule, Context& context) {
+  const std::optional<Resolved> resolved = resolve(action, rule, context);
+  if (!resolved) return std::nullopt;
+  const LaunchRequest& request = resolved->request;
+  std::string text = "would run " + context.shownText(request.program) + " " +
+                     context.shownText(QuotedArguments(resolved->arguments)) + " as user ID " +
+                     std::to_string(request.identity->uid) + ", group ID " +
+                     std::to_string(request.identity->gid) + ", in " + request.workingDirectory;
+  if (resolved->limit > 0) text += ", for at most " + std::to_string(resolved->limit) + " s";
+  return text;
+}
+
+void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule& rule,
+                               Context& context) {
+  std::optional<Resolved> resolved = resolve(action, rule, context);
+  if (!resolved) return;
+  LaunchRequest& request = resolved->request;
+  const plist::Array& arguments = resolved->arguments;
+  const double limit = resolved->limit;
   if (DebugLevel() >= 3) {
     // An argument may carry a keychain password: the trace shows it masked.
     LogMessage(3, "    Executing command:\n      %s %s", context.shownText(request.program).c_str(),

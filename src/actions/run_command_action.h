@@ -16,12 +16,24 @@ class RunCommandAction final : public Action {
  public:
   explicit RunCommandAction(ProcessLauncher& launcher) : mLauncher(launcher) {}
   void perform(const plist::Dictionary& action, const FiredRule& rule, Context& context) override;
+  std::optional<std::string> describe(const plist::Dictionary& action, const FiredRule& rule,
+                                      Context& context) override;
 
   // The time limit, in seconds, of actions without a "timeout" key; 0 (the default) waits
   // without one. Any thread.
   void setDefaultTimeout(double seconds) { mDefaultTimeout.store(seconds); }
 
  private:
+  struct Resolved {
+    LaunchRequest request;
+    plist::Array arguments;  // as resolved, for the trace
+    double limit = 0;
+  };
+  // Everything perform launches: substitution done, user and group looked up; nullopt (logged)
+  // when the action ends before launching.
+  std::optional<Resolved> resolve(const plist::Dictionary& action, const FiredRule& rule,
+                                  Context& context);
+
   ProcessLauncher& mLauncher;
   std::atomic<double> mDefaultTimeout{0};
 };

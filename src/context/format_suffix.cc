@@ -235,6 +235,10 @@ bool HasNoNumber(const plist::Value& value) {
 
 }  // namespace
 
+bool IsAppliedFormatSuffix(std::string_view suffix) {
+  return suffix == "%t" || suffix == "%m" || ParseConversion(suffix).has_value();
+}
+
 std::optional<plist::Value> ApplyFormatSuffix(const std::optional<plist::Value>& value,
                                               std::string_view suffix) {
   // Arrays, dictionaries and data have no number to format: they come back unchanged.

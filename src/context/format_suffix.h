@@ -17,4 +17,8 @@ namespace tarvod {
 std::optional<plist::Value> ApplyFormatSuffix(const std::optional<plist::Value>& value,
                                               std::string_view suffix);
 
+// Whether ApplyFormatSuffix formats with this (trimmed, non-empty) suffix rather than returning
+// the value unchanged.
+bool IsAppliedFormatSuffix(std::string_view suffix);
+
 }  // namespace tarvod

@@ -3,7 +3,9 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
+#include "engine/rules_check.h"
 #include "plist/value.h"
 
 namespace tarvod {
@@ -16,6 +18,11 @@ inline constexpr const char* kDefaultRulesPath = "/etc/tarvod.d/rules/";
 // one whose root is not a dictionary, counts as empty. Never logs.
 void LoadConfiguration(const std::string& path, plist::Dictionary* globals,
                        plist::Dictionary* configuration);
+
+// Appends the problems of the configuration file at path: a file that is not a property-list
+// dictionary, unknown keys, values of the wrong kind, periodicEvents entries the timers would
+// refuse. A missing file is a warning: the defaults apply.
+void CheckConfiguration(const std::string& path, std::vector<Problem>& problems);
 
 // A configuration value read as an integer (numbers, booleans and numeric strings); fallback
 // when the key is absent.

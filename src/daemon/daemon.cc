@@ -42,6 +42,23 @@ void LogSecuritySession() {
   LogMessage(4, "Velkin security session id = %x (%d)", static_cast<unsigned>(session), status);
 }
 
+// Each problem of the configuration and the rules at level 1, then one summary line at level 0,
+// so that the service's log shows a wrong rule without raising the debug level.
+RulebasePtr LoadRulesReporting(Engine& engine, const std::string& configurationPath,
+                               const std::string& rulesPath, size_t* count) {
+  LoadReport report;
+  CheckConfiguration(configurationPath, report.problems);
+  RulebasePtr rulebase = engine.loadRules(rulesPath, count, &report);
+  for (const Problem& problem : report.problems) {
+    LogMessage(1, "%s", FormatProblem(problem).c_str());
+  }
+  LogMessage(
+      0, "Rules from %s: %zu files read, %zu rules loaded, %zu files skipped, %zu problems found",
+      rulesPath.c_str(), report.filesRead, report.rulesLoaded, report.filesSkipped,
+      report.problems.size());
+  return rulebase;
+}
+
 std::optional<IdSet> FilterList(const plist::Dictionary& configuration, const char* key) {
   const plist::Value* value = configuration.find(key);
   return ParseFilterList(value ? std::optional<std::string>(value->textForm()) : std::nullopt);
@@ -53,6 +70,7 @@ Daemon::Daemon(const Clock& clock, Files& files) : mClock(clock), mFiles(files) 
 
 Daemon::~Daemon() {
   // The sources go first: they dispatch into the engine until their thread is joined.
+  mControl.reset();
   mRunningTimers.clear();
   mMonitor.reset();
   mEngine.reset();
@@ -111,8 +129,9 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   }
 
   size_t ruleCount = 0;
-  mEngine->swapRulebase(mEngine->loadRules(mRulesPath, &ruleCount));
+  mEngine->swapRulebase(LoadRulesReporting(*mEngine, mConfigurationPath, mRulesPath, &ruleCount));
   LogMessage(1, "Loaded %zu rules\n", ruleCount);
+  mFigures.rulesLoaded = ruleCount;
   if (ruleCount == 0) {
     LogMessage(0, "No rules found in %s, quitting....", mRulesPath.c_str());
     LogMessage(0, "Velkin Shutdown at %s", LocalDateText(mClock).c_str());
@@ -143,10 +162,25 @@ std::optional<int> Daemon::startup(int argc, char** argv) {
   }
   const int registered = RegisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
   mMonitor->beginListening();
+  StartControlSocket();
   LogMessage(1, "Registered %d events", registered);
   EnableCompanionLogJob();
   NotifyServiceManager("READY=1");
   return std::nullopt;
+}
+
+void Daemon::StartControlSocket() {
+  mFigures.startedAt = mClock.monotonic();
+  const std::string path = ControlSocketPath(
+      ConfigurationString(mConfiguration, "eventSocketPath", kDefaultEventSocketPath));
+  std::string error;
+  mControl = ControlSocket::Start(
+      path,
+      [this](const std::string& request) {
+        return ControlAnswer(request, mFigures, *mEngine, mMonitor.get());
+      },
+      &error);
+  if (!mControl) LogMessage(0, "The control socket is not available: %s", error.c_str());
 }
 
 void Daemon::runMainLoop() {
@@ -186,8 +220,10 @@ void Daemon::ReloadRules() {
   CancelPeriodicEvents(mRunningTimers);
   UnregisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
   size_t ruleCount = 0;
-  RulebasePtr rulebase = mEngine->loadRules(mRulesPath, &ruleCount);
+  RulebasePtr rulebase = LoadRulesReporting(*mEngine, mConfigurationPath, mRulesPath, &ruleCount);
   LogMessage(1, "Loaded %zu rules\n", ruleCount);
+  mFigures.rulesLoaded = ruleCount;
+  mFigures.lastReload = mClock.now();
   mEngine->swapRulebase(std::move(rulebase));
   ReopenKeptLogFiles();
   mEngine->postStartupEvent(true);
@@ -202,6 +238,7 @@ void Daemon::Shutdown() {
   CancelPeriodicEvents(mRunningTimers);
   mEngine->postShutdownEvent();
   UnregisterNotifications(mCenter, *mEngine->rulebase(), *mMonitor);
+  mControl.reset();
   mMonitor->stopListening();
   mEngine->closeDispatch();
 

@@ -7,8 +7,10 @@
 #include <optional>
 #include <string>
 
+#include "daemon/control.h"
 #include "engine/engine.h"
 #include "platform/clock.h"
+#include "platform/control_socket.h"
 #include "platform/files.h"
 #include "platform/main_loop.h"
 #include "platform/notification_center.h"
@@ -37,6 +39,9 @@ class Daemon {
   void Shutdown();
 
  private:
+  // `tarvodctl stats` and `status`; a failure is logged and the daemon runs on.
+  void StartControlSocket();
+
   const Clock& mClock;
   Files& mFiles;
   std::string mConfigurationPath;
@@ -47,6 +52,8 @@ class Daemon {
   NotificationCenter& mCenter = NotificationCenter::Default();
   std::unique_ptr<MainLoop> mMainLoop;
   RunningTimers mRunningTimers;
+  DaemonFigures mFigures;
+  std::unique_ptr<ControlSocket> mControl;  // stopped before the Monitor and the Engine
 };
 
 // main: the process exit status.

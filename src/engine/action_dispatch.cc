@@ -9,6 +9,7 @@
 #include "actions/send_email_action.h"
 #include "engine/keyword_tables.h"
 #include "engine/rule_processor.h"
+#include "engine/stats.h"
 #include "platform/diagnostic_log.h"
 
 namespace tarvod {
@@ -86,12 +87,23 @@ void SetMailPrograms(const std::string& local, const std::string& relay) {
   MailHandler(true).setPrograms(MailPrograms{local, relay});
 }
 
-void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Context& context) {
+void ProcessAction(const plist::Dictionary& action, const FiredRule& rule, Context& context,
+                   DryRun* dryRun) {
   const plist::Value* type = action.find("type");
   const std::string written = type ? type->textForm() : "(null)";
   const long code = type ? ActionCode(LowerCase(written)).value_or(kNullAction) : kNullAction;
   LogMessage(2, "  Executing action %s (%ld)", written.c_str(), code);
-  if (Action* handler = HandlerFor(code)) handler->perform(action, rule, context);
+  Action* handler = HandlerFor(code);
+  if (dryRun != nullptr) {
+    const std::optional<std::string> described =
+        handler ? handler->describe(action, rule, context) : std::string("does nothing");
+    dryRun->note("  action %s: %s", written.c_str(),
+                 described ? described->c_str() : "fails (see the message above)");
+  } else if (handler) {
+    const uint64_t problems = RuleProblemCount();
+    handler->perform(action, rule, context);
+    Statistics().actionRan(code, RuleProblemCount() != problems);
+  }
   LogMessage(2, "%s", "");
 }
 

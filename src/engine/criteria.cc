@@ -162,9 +162,21 @@ Decision Decide(int code, const Value& first, const Value* second, Context& cont
   }
 }
 
+const char* KindName(const Value& v) {
+  if (v.isString()) return "string";
+  if (v.isBoolean()) return "boolean";
+  if (v.isInteger()) return "integer";
+  if (v.isNumber()) return "real";
+  if (v.isArray()) return "array";
+  if (v.isDictionary()) return "dictionary";
+  if (v.isDate()) return "date";
+  return "data";
+}
+
 }  // namespace
 
-bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Context& context) {
+bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Context& context,
+                     DryRun* dryRun) {
   const std::string* path = rule.findString("filePath");
   const std::string filePath = path ? *path : std::string();
 
@@ -179,10 +191,12 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
     const std::string shown = written ? written->textForm() : "(null)";
     LogMessage(0, "The operator %s is invalid in the criteria:\n%s", shown.c_str(),
                plist::Describe(criterion).c_str());
+    if (dryRun) dryRun->note("  criterion: invalid operator %s: failed", shown.c_str());
     return false;
   }
   if (*code == 0) {
     LogMessage(2, "    Evaluating always-true criteria");
+    if (dryRun) dryRun->note("  criterion: true: passed");
     return true;
   }
 
@@ -192,6 +206,8 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
     std::optional<Value> resolved = context.resolveVariablesInArray(*given, filePath, &error);
     if (error) {
       LogMessage(0, "Error: %s", error->description.c_str());
+      if (dryRun)
+        dryRun->note("  criterion: %s: operands cannot be resolved: failed", keyword.c_str());
       return false;
     }
     if (resolved && resolved->isArray()) operands = std::move(resolved->array());
@@ -199,6 +215,7 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
   if (operands.empty()) {
     LogMessage(0, "Error: Criteria failed because it has no operands for operator %s",
                keyword.c_str());
+    if (dryRun) dryRun->note("  criterion: %s without operands: failed", keyword.c_str());
     return false;
   }
 
@@ -214,7 +231,16 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
     LogMessage(2, "    Evaluating criteria: %s %s %s", context.shownValue(first).c_str(),
                keyword.c_str(), second ? context.shownValue(*second).c_str() : "(null)");
   }
-  return Decide(*code, first, second, context, filePath).value_or(false);
+  const bool passed = Decide(*code, first, second, context, filePath).value_or(false);
+  if (dryRun) {
+    // The kinds are shown: 5 and "5" print alike but are never equal.
+    dryRun->note(
+        "  criterion: %s (%s) %s %s: %s", context.shownValue(first).c_str(), KindName(first),
+        keyword.c_str(),
+        second ? (context.shownValue(*second) + " (" + KindName(*second) + ")").c_str() : "",
+        passed ? "passed" : "failed");
+  }
+  return passed;
 }
 
 bool IsUserInGroup(const std::string& user, const std::string& group) {

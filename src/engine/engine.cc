@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <filesystem>
 #include <memory>
 #include <string>
@@ -15,6 +16,7 @@
 #include "engine/keyword_tables.h"
 #include "engine/rule_processor.h"
 #include "engine/rules_loader.h"
+#include "engine/stats.h"
 #include "platform/diagnostic_log.h"
 #include "platform/structured_log.h"
 
@@ -40,15 +42,22 @@ std::vector<std::string_view> TypePrefixes(std::string_view type) {
 void QueuePrefix(SerialQueue& queue, double now, std::string_view prefix,
                  const RulebaseEntry& entry, const std::shared_ptr<const plist::Dictionary>& event,
                  const RulebasePtr& rulebase, const VariableStorePtr& variables,
-                 const std::shared_ptr<Keychain>& keychain) {
+                 const std::shared_ptr<Keychain>& keychain, DryRun* dryRun) {
   LogMessage(2, "  Processing event: %.*s", static_cast<int>(prefix.size()), prefix.data());
   auto context = std::make_shared<Context>(variables, rulebase, *event, keychain);
 
   // The counter runs in the rulebase entry, so "prefix:eventCounter" counts the events of
   // this prefix since the rules were loaded (a reload starts a new rulebase at 0); the
-  // context's copy is the count including this event.
-  const uint64_t count = entry.eventCounter.fetch_add(1, std::memory_order_relaxed) + 1;
-  entry.lastEventTimestamp.store(now, std::memory_order_relaxed);
+  // context's copy is the count including this event. A dry run leaves both alone.
+  uint64_t count = entry.eventCounter.load(std::memory_order_relaxed) + 1;
+  if (dryRun == nullptr) {
+    count = entry.eventCounter.fetch_add(1, std::memory_order_relaxed) + 1;
+    entry.lastEventTimestamp.store(now, std::memory_order_relaxed);
+  } else {
+    queue.async([dryRun, prefix = std::string(prefix), n = entry.rules.size()] {
+      dryRun->note("type prefix %s: %zu rules", prefix.c_str(), n);
+    });
+  }
   const std::string name(prefix);
   context->eventMetadata().set(name + ":eventCounter",
                                plist::Value::Integer(static_cast<int64_t>(count)));
@@ -58,10 +67,17 @@ void QueuePrefix(SerialQueue& queue, double now, std::string_view prefix,
   const std::vector<RulePtr>& rules = entry.rules;
   auto fired = std::make_shared<std::atomic<bool>>(false);
   for (const RulePtr& rule : rules) {
-    queue.async([rule, context, fired] {
-      if (ProcessRule(*rule, *context)) fired->store(true);
+    queue.async([rule, context, fired, dryRun] {
+      const auto start = std::chrono::steady_clock::now();
+      const bool didFire = ProcessRule(*rule, *context, dryRun);
+      if (didFire) fired->store(true);
+      if (dryRun == nullptr) {
+        const std::chrono::duration<double> spent = std::chrono::steady_clock::now() - start;
+        Statistics().ruleRan(*rule, didFire, spent.count());
+      }
     });
   }
+  if (dryRun) return;
   // On the serial queue the record job runs after every rule job queued above, which is the
   // wait on the prefix's rule jobs.
   const bool hasRules = !rules.empty();
@@ -109,11 +125,20 @@ Engine::~Engine() {
   }
 }
 
-void Engine::dispatchEvent(const plist::Dictionary& event) { dispatch(event, nullptr); }
+void Engine::dispatchEvent(const plist::Dictionary& event) { dispatch(event, nullptr, nullptr); }
 
-void Engine::dispatchEvent(plist::Dictionary&& event) { dispatch(event, &event); }
+void Engine::dispatchEvent(plist::Dictionary&& event) { dispatch(event, &event, nullptr); }
 
-void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned) {
+std::vector<std::string> Engine::dryRunEvent(const plist::Dictionary& event) {
+  DryRun dryRun;
+  withVariables(
+      [&](VariableStore& store) { dryRun.variables = std::make_shared<VariableStore>(store); });
+  dispatch(event, nullptr, &dryRun);
+  withVariables([](VariableStore&) {});  // after the event's jobs
+  return std::move(dryRun.lines);
+}
+
+void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned, DryRun* dryRun) {
   if (!mDispatchOpen.load()) return;
   const plist::Value* typeValue = event.find("eventType");
   if (typeValue == nullptr) return;
@@ -126,7 +151,10 @@ void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned) 
                type.size(), components, kMaxEventTypeBytes, kMaxEventTypeComponents);
     return;
   }
-  LogEvent(event);
+  if (dryRun == nullptr) {
+    LogEvent(event);
+    Statistics().eventDispatched();
+  }
   LogMessage(1, "EVENT RECEIVED: %s", type.c_str());
 
   const RulebasePtr rulebase = this->rulebase();
@@ -137,10 +165,11 @@ void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned) 
   for (const std::string_view prefix : TypePrefixes(type)) {
     auto found = rulebase->find(prefix);
     if (found != rulebase->end()) {
-      QueuePrefix(*mQueue, now, prefix, found->second, shared, rulebase, mVariables, mKeychain);
+      QueuePrefix(*mQueue, now, prefix, found->second, shared, rulebase,
+                  dryRun ? dryRun->variables : mVariables, mKeychain, dryRun);
       continue;
     }
-    if (prefix.size() == type.size()) {
+    if (prefix.size() == type.size() && dryRun == nullptr) {
       // The record of a type without rules is written by the processing queue too, in the
       // order of the queue's other records: the dispatching thread (the input queue) then
       // does no file or journal I/O of its own, and the record joins the queue's batch.
@@ -168,15 +197,16 @@ void Engine::postStartupEvent(bool reload) {
 
 void Engine::postShutdownEvent() { dispatchEvent(daemonEvent("shutdown")); }
 
-RulebasePtr Engine::loadRules(const std::string& path, size_t* count) {
+RulebasePtr Engine::loadRules(const std::string& path, size_t* count, LoadReport* report) {
+  std::error_code error;
+  const bool directory = PathExtension(path).empty() || std::filesystem::is_directory(path, error);
   auto rulebase = std::make_shared<Rulebase>();
   size_t loaded = 0;
   withVariables([&](VariableStore&) {
     // A reload also picks up a store replaced with its old modification time.
     if (mKeychain) mKeychain->forget();
-    loaded = PathExtension(path).empty()
-                 ? LoadRulesDirectory(*rulebase, mVariables, path, mKeychain)
-                 : LoadRulesFile(*rulebase, mVariables, path, mKeychain);
+    loaded = directory ? LoadRulesDirectory(*rulebase, mVariables, path, mKeychain, report)
+                       : LoadRulesFile(*rulebase, mVariables, path, mKeychain, report);
   });
   if (count) *count = loaded;
   return rulebase;
@@ -196,6 +226,7 @@ void Engine::swapRulebase(RulebasePtr rulebase) {
   // The previous generation is released outside the lock: freeing a large rulebase must not
   // hold up dispatching threads.
   mPreviousRulebase = std::move(replaced);
+  Statistics().forgetRules();
 }
 
 bool Engine::withVariables(const std::function<void(VariableStore&)>& work) {

@@ -9,8 +9,10 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <vector>
 
 #include "context/types.h"
+#include "engine/rules_check.h"
 #include "platform/clock.h"
 #include "platform/serial_queue.h"
 #include "plist/value.h"
@@ -18,6 +20,7 @@
 namespace tarvod {
 
 class Keychain;
+struct DryRun;
 
 class Engine {
  public:
@@ -31,14 +34,19 @@ class Engine {
   void dispatchEvent(const plist::Dictionary& event);
   // The same, keeping the event itself instead of a copy.
   void dispatchEvent(plist::Dictionary&& event);
+  // The same dispatch in dry-run mode (DryRun in rule_processor.h): the rules run on a copy of
+  // the variable store, event counters and records are left alone, actions only say what they
+  // would do. Waits for the event's jobs and returns the report's lines. Main thread.
+  std::vector<std::string> dryRunEvent(const plist::Dictionary& event);
   // "startup.load" (or "startup.reload" when reload is true) and "shutdown", from "tarvod".
   void postStartupEvent(bool reload);
   void postShutdownEvent();
 
-  // Reads the rules at path (one file when its last component has an extension, else the
-  // whole tree) into a new rulebase, on the queue, since "eval on load" variables write the
-  // store. *count receives the number of rules loaded.
-  RulebasePtr loadRules(const std::string& path, size_t* count);
+  // Reads the rules at path (the whole tree when it names a directory or its last component
+  // has no extension, else one file) into a new rulebase, on the queue, since "eval on load"
+  // variables write the store. *count receives the number of rules loaded; report, when given,
+  // what was read and every problem found.
+  RulebasePtr loadRules(const std::string& path, size_t* count, LoadReport* report = nullptr);
   // The rulebase events are dispatched against.
   RulebasePtr rulebase() const;
   // One indivisible exchange: an event dispatched meanwhile sees the whole old rulebase or the
@@ -66,8 +74,9 @@ class Engine {
 
  private:
   plist::Dictionary daemonEvent(const char* type) const;
-  // owned, when set, is event itself, which may be moved from once read.
-  void dispatch(const plist::Dictionary& event, plist::Dictionary* owned);
+  // owned, when set, is event itself, which may be moved from once read; dryRun, when set,
+  // collects the report of a dry run.
+  void dispatch(const plist::Dictionary& event, plist::Dictionary* owned, DryRun* dryRun);
 
   const Clock& mClock;
   std::unique_ptr<SerialQueue> mQueue;

@@ -2,6 +2,8 @@
 
 #include "engine/rule_processor.h"
 
+#include <cstdarg>
+#include <cstdio>
 #include <optional>
 #include <string>
 
@@ -17,18 +19,27 @@ enum class Mode { kAny, kAll, kNone };
 // Assigns every entry of a variables dictionary, keys in ascending byte order, so that a value
 // may refer to a name that sorts before it and see the value just set.
 void AssignVariables(const plist::Dictionary& variables, const std::string& filePath,
-                     Context& context) {
+                     Context& context, DryRun* dryRun) {
   for (const std::string& key : variables.sortedKeys()) {
     context.setVariableValue(*variables.find(key), key, filePath);
+    if (dryRun) {
+      // The name may itself hold references ("failures_${event:clientIP}").
+      const std::optional<plist::Value> name =
+          context.resolveVariablesInString(key, filePath, nullptr);
+      const std::string shownName = name ? name->textForm() : key;
+      dryRun->note("  sets %s = %s", shownName.c_str(),
+                   context.shownValue(context.variableValueForKey(shownName, filePath)).c_str());
+    }
   }
 }
 
 // One criterion entry. An entry that is not a dictionary has no operator: it fails with the
 // message of an invalid operator.
-bool EvaluateEntry(const plist::Value& entry, const Rule& rule, Context& context) {
+bool EvaluateEntry(const plist::Value& entry, const Rule& rule, Context& context, DryRun* dryRun) {
   if (const plist::Dictionary* criterion = entry.asDictionary()) {
-    return ProcessCriteria(*criterion, rule, context);
+    return ProcessCriteria(*criterion, rule, context, dryRun);
   }
+  if (dryRun) dryRun->note("  criterion: not a dictionary: failed");
   LogMessage(0, "The operator %s is invalid in the criteria:\n%s", "(null)",
              plist::Describe(entry).c_str());
   return false;
@@ -36,13 +47,24 @@ bool EvaluateEntry(const plist::Value& entry, const Rule& rule, Context& context
 
 }  // namespace
 
-bool ProcessRule(const Rule& rule, Context& context) {
+void DryRun::note(const char* format, ...) {
+  char buffer[kMaxLogMessageBytes + 1];
+  va_list args;
+  va_start(args, format);
+  std::vsnprintf(buffer, sizeof buffer, format, args);
+  va_end(args);
+  lines.emplace_back(buffer);
+}
+
+bool ProcessRule(const Rule& rule, Context& context, DryRun* dryRun) {
   const plist::Value* nameValue = rule.find("name");
   const plist::Value* filePathValue = rule.find("filePath");
   const std::string name = nameValue ? nameValue->textForm() : "(null)";
   const std::string filePath = filePathValue ? filePathValue->textForm() : std::string();
   LogMessage(2, "PROCESSING RULE: %s (%s)", name.c_str(),
              filePathValue ? filePath.c_str() : "(null)");
+  const RuleMessageScope scope(name, filePath);
+  if (dryRun) dryRun->note("rule \"%s\" (%s)", name.c_str(), filePath.c_str());
   if (DebugLevel() >= 5) LogMessage(5, "  Description:\n%s", plist::Describe(rule).c_str());
 
   const plist::Value* criterionValue = rule.find("criterion");
@@ -78,7 +100,7 @@ bool ProcessRule(const Rule& rule, Context& context) {
       // evaluated.
       fires = mode == Mode::kAll;
       for (const plist::Value& entry : *entries) {
-        const bool passed = EvaluateEntry(entry, rule, context);
+        const bool passed = EvaluateEntry(entry, rule, context, dryRun);
         LogMessage(2, "      %s", passed ? "Passed" : "Failed");
         if (mode == Mode::kAny && passed) {
           fires = true;
@@ -92,6 +114,7 @@ bool ProcessRule(const Rule& rule, Context& context) {
     }
   }
 
+  if (dryRun) dryRun->note("  %s", fires ? "fires" : "does not fire");
   if (!fires) {
     LogMessage(2, "  Criterion did not pass. Skipping rule.");
     LogMessage(2, "%s", "");
@@ -108,7 +131,7 @@ bool ProcessRule(const Rule& rule, Context& context) {
       loaded = LoadVariablesFile(path);
     }
     if (loaded) {
-      AssignVariables(*loaded, filePath, context);
+      AssignVariables(*loaded, filePath, context, dryRun);
     } else {
       LogMessage(3, "        failed to load variables from %s", path.c_str());
     }
@@ -117,7 +140,7 @@ bool ProcessRule(const Rule& rule, Context& context) {
   LogMessage(3, "    processing variables from rule");
   if (const plist::Value* variables = rule.find("variables")) {
     if (const plist::Dictionary* dictionary = variables->asDictionary()) {
-      AssignVariables(*dictionary, filePath, context);
+      AssignVariables(*dictionary, filePath, context, dryRun);
     } else {
       LogMessage(0, "ProcessRule: the variables of rule %s are not a dictionary.", name.c_str());
     }
@@ -127,7 +150,7 @@ bool ProcessRule(const Rule& rule, Context& context) {
     const FiredRule fired{rule, name, filePath};
     for (const plist::Value& action : *actions) {
       const plist::Dictionary* dictionary = action.asDictionary();
-      ProcessAction(dictionary ? *dictionary : kNoAction, fired, context);
+      ProcessAction(dictionary ? *dictionary : kNoAction, fired, context, dryRun);
     }
   }
   LogMessage(2, "%s", "");

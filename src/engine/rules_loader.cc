@@ -33,6 +33,16 @@ void AssignLoadTimeVariables(const VariableStorePtr& variables, const std::strin
   LogMessage(3, "  finished with the \"eval on load\" vairables");
 }
 
+// Copies editors and package managers leave beside the file they replace: loading them would
+// run an old rule next to its new version.
+bool IsLeftover(std::string_view name) {
+  for (const std::string_view ending :
+       {"~", ".swp", ".dpkg-old", ".dpkg-new", ".dpkg-dist", ".rpmsave", ".rpmnew"}) {
+    if (name.ends_with(ending)) return true;
+  }
+  return false;
+}
+
 }  // namespace
 
 std::optional<plist::Dictionary> LoadVariablesFile(const std::string& path) {
@@ -45,12 +55,21 @@ std::optional<plist::Dictionary> LoadVariablesFile(const std::string& path) {
 }
 
 size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables, const std::string& path,
-                     const std::shared_ptr<Keychain>& keychain) {
+                     const std::shared_ptr<Keychain>& keychain, LoadReport* report) {
   std::optional<plist::Value> file = plist::ReadPropertyListFile(path);
-  if (!file || !file->isArray()) return 0;
+  if (!file || !file->isArray()) {
+    if (report) {
+      ++report->filesSkipped;
+      report->add(FileProblem(path, file ? "the top level is not an array of rules; skipped"
+                                         : "cannot be read as a property list; skipped"));
+    }
+    return 0;
+  }
   LogMessage(2, "LOADING RULES (%s)", path.c_str());
   size_t accepted = 0;
+  size_t index = 0;
   for (plist::Value& element : file->array()) {
+    if (report) CheckRule(element, path, ++index, report->problems);
     plist::Dictionary* source = element.asDictionary();
     if (!source) continue;
     const plist::Array* eventTypes = source->findArray("eventTypes");
@@ -70,22 +89,24 @@ size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables, cons
     for (const plist::Value& type : types) {
       // Types are matched as exact strings. Anything else in the list is skipped: indexed
       // under its text form, 5 or a nested array would match events of that type.
-      if (!type.isString()) {
-        LogMessage(1, "  Skipping event type %s of rule %s: not a string",
-                   plist::Describe(type).c_str(), name.c_str());
-        continue;
-      }
+      // (CheckRule reports it.)
+      if (!type.isString()) continue;
       rulebase[type.string()].rules.push_back(rule);
       LogMessage(3, "  Added rule: %s", name.c_str());
     }
     ++accepted;
   }
   LogMessage(2, "%s", "");
+  if (report) {
+    ++report->filesRead;
+    report->rulesLoaded += accepted;
+  }
   return accepted;
 }
 
 size_t LoadRulesDirectory(Rulebase& rulebase, const VariableStorePtr& variables,
-                          const std::string& path, const std::shared_ptr<Keychain>& keychain) {
+                          const std::string& path, const std::shared_ptr<Keychain>& keychain,
+                          LoadReport* report) {
   LogMessage(3, "Loading rules files from %s\n", path.c_str());
   // Entries are visited depth first, each directory's entries sorted by name, so that the
   // order rules run in does not depend on how the file system happens to list them.
@@ -113,7 +134,15 @@ size_t LoadRulesDirectory(Rulebase& rulebase, const VariableStorePtr& variables,
         subdirectories.push_back(entryPath);
         continue;
       }
-      total += LoadRulesFile(rulebase, variables, entryPath, keychain);
+      if (IsLeftover(entryPath)) {
+        if (report) {
+          ++report->filesSkipped;
+          report->add(FileProblem(entryPath, "an editor's or package manager's leftover; skipped",
+                                  Problem::Severity::kWarning));
+        }
+        continue;
+      }
+      total += LoadRulesFile(rulebase, variables, entryPath, keychain, report);
     }
     // Pushed in reverse so the first subdirectory is walked first.
     for (auto it = subdirectories.rbegin(); it != subdirectories.rend(); ++it) {

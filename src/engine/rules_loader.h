@@ -9,18 +9,25 @@
 #include <string>
 
 #include "context/types.h"
+#include "engine/rules_check.h"
 #include "plist/value.h"
 
 namespace tarvod {
 
 class Keychain;
 
-// keychain, when given, serves the "keychain:" references of load-time variables.
+// keychain, when given, serves the "keychain:" references of load-time variables. report, when
+// given, receives the files read and skipped, the rules loaded and every file's problems
+// (CheckRule); the loader itself accepts and skips rules the same way with or without it.
 size_t LoadRulesFile(Rulebase& rulebase, const VariableStorePtr& variables, const std::string& path,
-                     const std::shared_ptr<Keychain>& keychain = nullptr);
+                     const std::shared_ptr<Keychain>& keychain = nullptr,
+                     LoadReport* report = nullptr);
+// Editors' and package managers' leftovers ("rules.plist~", ".swp", ".dpkg-old", ".rpmnew",
+// ...) are skipped, and named in the report.
 size_t LoadRulesDirectory(Rulebase& rulebase, const VariableStorePtr& variables,
                           const std::string& path,
-                          const std::shared_ptr<Keychain>& keychain = nullptr);
+                          const std::shared_ptr<Keychain>& keychain = nullptr,
+                          LoadReport* report = nullptr);
 // A variables file's dictionary; nullopt (with its level-4 message) when it cannot be read.
 std::optional<plist::Dictionary> LoadVariablesFile(const std::string& path);
 

@@ -10,6 +10,7 @@
 #include <condition_variable>
 #include <cstdarg>
 #include <cstdio>
+#include <cstring>
 #include <functional>
 #include <mutex>
 #include <optional>
@@ -131,7 +132,33 @@ bool IsLogDestination(const struct stat& file) {
 void SetDebugLevel(int64_t level) { gDebugLevel.store(level, std::memory_order_relaxed); }
 int64_t DebugLevel() { return gDebugLevel.load(std::memory_order_relaxed); }
 
+namespace {
+
+// The rule this thread is running, while a RuleMessageScope is open.
+thread_local const std::string* tRuleName = nullptr;
+thread_local const std::string* tRuleFile = nullptr;
+thread_local uint64_t tRuleProblems = 0;
+
+// Problems raised while a rule runs are written at these levels; traces use the higher ones.
+constexpr int64_t kHighestRuleProblemLevel = 1;
+
+}  // namespace
+
+RuleMessageScope::RuleMessageScope(const std::string& name, const std::string& file)
+    : mName(tRuleName), mFile(tRuleFile) {
+  tRuleName = &name;
+  tRuleFile = &file;
+}
+
+RuleMessageScope::~RuleMessageScope() {
+  tRuleName = mName;
+  tRuleFile = mFile;
+}
+
+uint64_t RuleProblemCount() { return tRuleProblems; }
+
 void LogMessage(int64_t level, const char* format, ...) {
+  if (tRuleName != nullptr && level <= kHighestRuleProblemLevel) ++tRuleProblems;
   if (level > gDebugLevel.load(std::memory_order_relaxed)) return;
   ErrorLog& log = gErrorLog;
   std::lock_guard<std::mutex> lock(log.mLock);
@@ -142,6 +169,14 @@ void LogMessage(int64_t level, const char* format, ...) {
   va_end(args);
   size_t length = 0;
   if (n > 0) length = std::min(static_cast<size_t>(n), kMaxLogMessageBytes);
+  if (tRuleName != nullptr && level <= kHighestRuleProblemLevel) {
+    // The message text stays first; the rule follows, cutting the text rather than itself.
+    const std::string rule = " (rule \"" + *tRuleName + "\" in " + *tRuleFile + ")";
+    const size_t kept = std::min(rule.size(), kMaxLogMessageBytes);
+    length = std::min(length, kMaxLogMessageBytes - kept);
+    std::memcpy(log.mBuffer + length, rule.data(), kept);
+    length += kept;
+  }
   bool write = true;
   if (level <= kHighestLimitedLevel) {
     write = log.mRepeats.admit(std::string_view(log.mBuffer, length), log.mSummaries);

@@ -6,6 +6,7 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <string>
 
 #include "plist/value.h"
 
@@ -22,7 +23,27 @@ inline constexpr size_t kMaxLogMessageBytes = 2047;
 // the error log starts at the first counted repeat and stops in CloseLogs (which writes the
 // counts still open). Different texts are never counted together; lines of the higher
 // levels are always written.
+// While a RuleMessageScope is open on the calling thread, lines of levels 0 and 1 (the
+// problems; traces are written at 2 and above) end with ` (rule "NAME" in FILE)`.
 void LogMessage(int64_t level, const char* format, ...) __attribute__((format(printf, 2, 3)));
+
+// How many problem lines (levels 0 and 1, written or not) the calling thread has raised under
+// a RuleMessageScope: an action that raised one has failed.
+uint64_t RuleProblemCount();
+
+// Names the rule the calling thread runs in its problem messages until destroyed; scopes nest.
+// name and file must outlive the scope.
+class RuleMessageScope {
+ public:
+  RuleMessageScope(const std::string& name, const std::string& file);
+  ~RuleMessageScope();
+  RuleMessageScope(const RuleMessageScope&) = delete;
+  RuleMessageScope& operator=(const RuleMessageScope&) = delete;
+
+ private:
+  const std::string* mName;
+  const std::string* mFile;
+};
 
 // The repeat interval in seconds (10 until set); 0 or less writes every line. The counts
 // still open are written first.

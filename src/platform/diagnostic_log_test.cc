@@ -52,6 +52,22 @@ TEST_F(DiagnosticLogTest, CutsLongMessagesAndAlwaysAddsOneNewline) {
   EXPECT_EQ(testing::ReadWholeFile(path_), std::string(2047, 'x') + "\nLoaded 2 rules\n\n");
 }
 
+TEST_F(DiagnosticLogTest, ProblemsWrittenWhileARuleRunsNameItAfterTheirText) {
+  SetDebugLevel(2);
+  const std::string name = "ban", file = "/r/ssh.plist";
+  {
+    const RuleMessageScope scope(name, file);
+    LogMessage(0, "LOG: Cannot open %s", "/x");
+    LogMessage(2, "trace");
+    LogMessage(1, "%s", std::string(3000, 'x').c_str());
+  }
+  LogMessage(0, "after");
+  const std::string rule = " (rule \"ban\" in /r/ssh.plist)";
+  EXPECT_EQ(testing::ReadWholeFile(path_), "LOG: Cannot open /x" + rule + "\ntrace\n" +
+                                               std::string(2047 - rule.size(), 'x') + rule +
+                                               "\nafter\n");
+}
+
 TEST_F(DiagnosticLogTest, LinesFromConcurrentWritersNeverInterleave) {
   std::vector<std::thread> writers;
   for (int t = 0; t < 4; ++t) {

@@ -44,7 +44,7 @@ void SerialQueue::async(std::function<void()> job) {
     std::lock_guard<std::mutex> lock(mLock);
     if (mAbandoned) return;
     mJobs.push_back(std::move(job));
-    ++mPending;
+    if (++mPending > mHighWater) mHighWater = mPending;
   }
   mWorkAvailable.notify_one();
 }
@@ -76,6 +76,11 @@ bool SerialQueue::drainFor(double seconds) {
   std::unique_lock<std::mutex> lock(mLock);
   return mProgress.wait_for(lock, std::chrono::duration<double>(seconds),
                             [&] { return mPending == 0; });
+}
+
+size_t SerialQueue::highWater() const {
+  std::lock_guard<std::mutex> lock(mLock);
+  return mHighWater;
 }
 
 size_t SerialQueue::pending() const {

@@ -47,6 +47,8 @@ class SerialQueue {
 
   // Jobs submitted and not yet finished (the one running included).
   size_t pending() const;
+  // The most jobs ever pending at once.
+  size_t highWater() const;
   // Blocks the caller until at most limit jobs are pending.
   void waitUntilPendingAtMost(size_t limit);
   // A non-blocking eventfd that becomes readable once at most limit jobs are pending, after
@@ -85,6 +87,7 @@ class SerialQueue {
   std::deque<std::function<void()>> mJobs;
   std::function<void()> mIdleHandler;
   size_t mPending = 0;
+  size_t mHighWater = 0;
   bool mStopping = false;
   bool mAbandoned = false;
   size_t mSignalLimit = 0;

@@ -217,7 +217,7 @@ std::optional<plist::Dictionary> AuditRecordToEvent(std::span<const uint8_t> rec
 
 void ConvertAuditRecord(std::span<const uint8_t> record, Monitor& monitor) {
   if (std::optional<plist::Dictionary> event = AuditRecordToEvent(record)) {
-    monitor.processEvent(std::move(*event));
+    monitor.processEvent(std::move(*event), Monitor::EventSource::kSshLogins);
   }
 }
 

@@ -230,7 +230,9 @@ std::unique_ptr<EventListener> EventListener::Create(Monitor& monitor, EventLoop
                                                      const std::string& path) {
   SocketResult socket = ListenSeqpacket(path, kListenBacklog);
   if (socket.fd < 0) {
-    LogMessage(2, "SetXPCListenerFor: %s", socket.error.c_str());
+    // The daemon runs on without its event socket: say why where an administrator looks.
+    LogMessage(0, "SetXPCListenerFor: %s", socket.error.c_str());
+    ConsoleMessage("tarvod: the event socket cannot be opened: %s", socket.error.c_str());
     return nullptr;
   }
   std::unique_ptr<EventListener> listener(

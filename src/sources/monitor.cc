@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <chrono>
 #include <vector>
 
 #include "platform/diagnostic_log.h"
@@ -11,6 +12,13 @@
 #include "sources/ssh_journal.h"
 
 namespace tarvod {
+namespace {
+
+double MonotonicSeconds() {
+  return std::chrono::duration<double>(std::chrono::steady_clock::now().time_since_epoch()).count();
+}
+
+}  // namespace
 namespace {
 
 constexpr const char* kInputQueueLabel = "com.quenta.tarvod.inputq";
@@ -60,8 +68,9 @@ bool Monitor::filterBySourceUID(uint32_t uid, uint32_t gid) const {
   return false;
 }
 
-void Monitor::processEvent(plist::Dictionary event) {
+void Monitor::processEvent(plist::Dictionary event, EventSource source) {
   if (DebugLevel() >= 3) LogMessage(3, "Event received: %s ", plist::Describe(event).c_str());
+  countEvent(source);
   if (mHooks.dispatch) mHooks.dispatch(std::move(event));
 }
 
@@ -86,7 +95,7 @@ void Monitor::beginListening() {
 
   LogMessage(1, "Starting the New XPC event listener");
   if (SetXPCListenerFor(*mInputEvtQ) != 0) {
-    LogMessage(1, "XPC event listener failed to start up");
+    LogMessage(0, "XPC event listener failed to start up");
   }
 
   if (mAuthLogSource == "journal") {
@@ -155,7 +164,18 @@ void Monitor::applyBackPressure() {
   if (!mHooks.backlog || !mProgressSource || !mInputEvtQ->isCurrentThread()) return;
   if (!mInputEvtQ->readGateOpen() || mHooks.backlog() <= kBackPressureHighJobs) return;
   mInputEvtQ->setReadGateOpen(false);
+  mPauses.fetch_add(1, std::memory_order_relaxed);
+  mPausedSince.store(MonotonicSeconds(), std::memory_order_relaxed);
   mHooks.signalWhenBacklogAtMost(kBackPressureLowJobs);
+}
+
+Monitor::BackPressure Monitor::backPressure() const {
+  BackPressure result{mPauses.load(std::memory_order_relaxed),
+                      mPausedSeconds.load(std::memory_order_relaxed)};
+  if (const double since = mPausedSince.load(std::memory_order_relaxed); since > 0) {
+    result.seconds += MonotonicSeconds() - since;
+  }
+  return result;
 }
 
 void Monitor::onBacklogProgress() {
@@ -164,6 +184,12 @@ void Monitor::onBacklogProgress() {
   if (mInputEvtQ->readGateOpen()) return;
   if (mHooks.backlog() <= kBackPressureLowJobs) {
     mInputEvtQ->setReadGateOpen(true);
+    const double since = mPausedSince.exchange(0, std::memory_order_relaxed);
+    if (since > 0) {
+      mPausedSeconds.store(
+          mPausedSeconds.load(std::memory_order_relaxed) + MonotonicSeconds() - since,
+          std::memory_order_relaxed);
+    }
   } else {
     mHooks.signalWhenBacklogAtMost(kBackPressureLowJobs);
   }

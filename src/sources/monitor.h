@@ -6,6 +6,8 @@
 // filterBySourceUID, applyBackPressure. Any thread: processEvent.
 #pragma once
 
+#include <array>
+#include <atomic>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -93,7 +95,9 @@ class Monitor {
   // A blocking reader of mAuditpipe that the daemon does not use; returns the error number
   // that ended it, or -1 when it could not start.
   int runAuditpipeListener();
-  void processEvent(plist::Dictionary event);
+  // Where events come from, as `tarvodctl stats` counts them.
+  enum class EventSource { kSocket, kSshLogins, kNotifications, kPeriodic, kCount };
+  void processEvent(plist::Dictionary event, EventSource source = EventSource::kSocket);
   // A notification observed for an event type (notifications.cc): its user information is
   // the event, an absent one an empty event.
   void processNotification(const Notification& notification);
@@ -115,9 +119,29 @@ class Monitor {
   void applyBackPressure();
   // The input queue; nullptr before the first beginListening.
   EventLoop* inputQueue() const { return mInputEvtQ.get(); }
+  // How often the read gate was closed, and for how long in all (the pause under way
+  // included). Any thread.
+  struct BackPressure {
+    uint64_t pauses = 0;
+    double seconds = 0;
+  };
+  BackPressure backPressure() const;
+  // Events handed to the engine from one source. Any thread.
+  uint64_t eventsFrom(EventSource source) const {
+    return mEventsFrom[static_cast<size_t>(source)].load(std::memory_order_relaxed);
+  }
 
  private:
   void onBacklogProgress();
+
+  void countEvent(EventSource source) {
+    mEventsFrom[static_cast<size_t>(source)].fetch_add(1, std::memory_order_relaxed);
+  }
+
+  std::array<std::atomic<uint64_t>, static_cast<size_t>(EventSource::kCount)> mEventsFrom{};
+  std::atomic<uint64_t> mPauses{0};
+  std::atomic<double> mPausedSeconds{0};  // of the pauses that ended
+  std::atomic<double> mPausedSince{0};    // monotonic seconds; 0 while the gate is open
 
   std::unique_ptr<EventListener> mXPCEventConnection;
   std::unique_ptr<EventLoop> mInputEvtQ;

@@ -35,6 +35,7 @@ void Monitor::processNotification(const Notification& notification) {
     LogMessage(5, "Description:\n%s ", DescribeNotification(notification).c_str());
   }
   // Not processEvent: notifications are not reported as "Event received".
+  countEvent(EventSource::kNotifications);
   if (mHooks.dispatch) mHooks.dispatch(notification.userInfo.value_or(plist::Dictionary()));
 }
 

@@ -100,6 +100,7 @@ void Monitor::periodicEvent(const plist::Dictionary& event) {
     LogMessage(3, "Periodic Event received: %s ", plist::Describe(event).c_str());
   }
   // Not processEvent: periodic events are not reported as "Event received".
+  countEvent(EventSource::kPeriodic);
   if (mHooks.dispatch) mHooks.dispatch(plist::Dictionary(event));
 }
 

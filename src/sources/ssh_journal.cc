@@ -66,7 +66,8 @@ void SshJournalSource::readEntries() {
   for (const JournalEntry& entry : entries) {
     if (!entry.cursor.empty()) mCursor = entry.cursor;
     if (std::optional<SshLogin> login = ParseSshLogLine(entry.message)) {
-      mMonitor.processEvent(SshLoginEvent(*login, entry.message, entry.timestamp));
+      mMonitor.processEvent(SshLoginEvent(*login, entry.message, entry.timestamp),
+                            Monitor::EventSource::kSshLogins);
       mMonitor.applyBackPressure();
     }
   }
