@@ -113,6 +113,77 @@ TEST(AdminTest, TestShowsWhatARuleWouldDoAndDoesNothing) {
   EXPECT_THAT(skipped.out, Not(HasSubstr("action")));
 }
 
+// Each example rule set, run from the saved counts its comment speaks of, does what the
+// comment promises: the fifth SSH failure of an address bans it (IPv4 or IPv6 set) and starts
+// its count again, the hourly event lifts every ban, the third sudo failure mails the
+// administrator, a file system crossing 90% is paged once, a failed job goes to the bus.
+TEST(AdminTest, ExampleRuleSetsDoWhatTheirCommentsSay) {
+  TempDir dir;
+  const std::string sets = std::string(TARVOD_SOURCE_DIR) + "/examples/rulesets/";
+  const std::string config = dir.write(
+      "tarvod.plist", ConfigPlist({{"saveState", "<true/>"}, {"stateDirectory", Str(dir.path())}},
+                                  Dict({{"adminEmail", Str("admin@example.com")},
+                                        {"pagerAddress", Str("pager@example.com")}})));
+  dir.write("state",
+            PlistDocument(Dict(
+                {{sets + "ssh-bruteforce.plist",
+                  Dict({{"failures_192.0.2.7", Int(4)}, {"failures_2001\\:db8\\:\\:1", Int(4)}})},
+                 {sets + "sudo-failures.plist", Dict({{"sudo_alice", Int(2)}})},
+                 {sets + "disk-space.plist", Dict({{"full_/var", Str("yes")}})}})));
+  struct Case {
+    std::string file;
+    std::vector<std::string> event;
+    std::vector<std::string> expected;
+  };
+  const Case cases[] = {
+      {"ssh-bruteforce.plist",
+       {"auth.failure", "clientIP=192.0.2.7", "username=bob"},
+       {"sets failures_192.0.2.7 = 0",
+        "banning 192.0.2.7 after 5 failed SSH logins (last user bob)",
+        "would run /usr/sbin/nft \"add\" \"element\" \"inet\" \"filter\" \"tarvod_ban4\" "
+        "\"{ 192.0.2.7 }\" as user ID 0"}},
+      {"ssh-bruteforce.plist",
+       {"auth.failure", "clientIP=2001:db8::1"},
+       {"\"tarvod_ban6\" \"{ 2001:db8::1 }\""}},
+      {"ssh-bruteforce.plist",
+       {"auth.failure", "clientIP=198.51.100.1"},
+       {"sets failures_198.51.100.1 = 1\nrule \"Ban an IPv4 address at its fifth failure\"",
+        "failed\n  does not fire\nrule \"Ban an IPv6"}},
+      {"ssh-bruteforce.plist",
+       {"ssh.unban"},
+       {"nft flush set inet filter tarvod_ban4; /usr/sbin/nft flush set inet filter tarvod_ban6"}},
+      {"sudo-failures.plist",
+       {"sudo.failure", "user=alice"},
+       {"sets sudo_alice = 0", "action sendemail: would mail admin@example.com",
+        "subject \"sudo: 3 failed attempts by alice on "}},
+      {"disk-space.plist", {"disk.check"}, {"df -P", "as user ID 65534"}},
+      {"disk-space.plist",
+       {"disk.usage", "percent=93", "mount=/"},
+       {"sets full_/ = yes", "action sendpage: would mail pager@example.com", "/ is 93% full"}},
+      {"disk-space.plist",
+       {"disk.usage", "percent=95", "mount=/var"},
+       {"notequal yes (string): failed\n  does not fire"}},
+      {"disk-space.plist", {"disk.usage", "percent=40", "mount=/var"}, {"sets full_/var = no"}},
+      {"notification-relay.plist",
+       {"job.finished", "job=backup", "status=failed"},
+       {"would post com.example.jobs with object \"job.failed\"", "eventType = job.failed;"}},
+      {"notification-relay.plist", {"job.finished", "job=backup", "status=ok"}, {"does not fire"}},
+      {"notification-relay.plist",
+       {"job.failed", "job=backup", "status=failed"},
+       {"would send to the structured log (kvlog, level error): job backup ended with failed"}},
+  };
+  for (const Case& c : cases) {
+    std::vector<std::string> args = {"test", "-c", config, "-r", sets + c.file};
+    args.insert(args.end(), c.event.begin(), c.event.end());
+    const RunResult result = Tarvodctl(args);
+    EXPECT_EQ(result.status, 0) << result.err;
+    for (const std::string& text : c.expected) {
+      EXPECT_THAT(result.out, HasSubstr(text)) << c.file << " " << c.event[0];
+    }
+    EXPECT_EQ(result.err, "") << c.file << " " << c.event[0];
+  }
+}
+
 }  // namespace
 }  // namespace tarvod::testing
 

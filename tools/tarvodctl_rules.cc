@@ -8,6 +8,7 @@
 
 #include "context/keychain.h"
 #include "daemon/configuration.h"
+#include "daemon/state.h"
 #include "engine/engine.h"
 #include "platform/clock.h"
 #include "platform/diagnostic_log.h"
@@ -91,14 +92,17 @@ void PrintJson(const tarvod::LoadReport& report, size_t errors, size_t warnings)
 }
 
 // An engine with the configuration's initial globals and keychain store, as the daemon starts
-// with them (the store is readable by root only; for others keychain references stay empty).
-std::unique_ptr<tarvod::Engine> EngineAsTheDaemonHasIt(const std::string& configurationPath) {
+// with them (the store is readable by root only; for others keychain references stay empty),
+// and with restoreState the variables saved at the daemon's last stop (read, never written).
+std::unique_ptr<tarvod::Engine> EngineAsTheDaemonHasIt(const std::string& configurationPath,
+                                                       bool restoreState = false) {
   plist::Dictionary globals;
   plist::Dictionary configuration;
   tarvod::LoadConfiguration(configurationPath, &globals, &configuration);
   auto engine = std::make_unique<tarvod::Engine>(tarvod::Clock::System(), std::move(globals));
   engine->setKeychain(std::make_shared<tarvod::Keychain>(
       tarvod::ConfigurationString(configuration, "keychainPath", tarvod::kDefaultKeychainPath)));
+  if (restoreState) tarvod::RestoreState(configuration, *engine, tarvod::Files::Real());
   return engine;
 }
 
@@ -162,7 +166,9 @@ int RunTest(const std::vector<std::string>& args, const std::string& configurati
   // The problems the rules run into (a substitution that fails, an unknown user) are the
   // daemon's level-0 messages: they go to standard error.
   tarvod::AttachErrorLog(dup(STDERR_FILENO));
-  const std::unique_ptr<tarvod::Engine> enginePointer = EngineAsTheDaemonHasIt(configurationPath);
+  // The counters and marks rules keep are those the daemon saved, as after a restart.
+  const std::unique_ptr<tarvod::Engine> enginePointer =
+      EngineAsTheDaemonHasIt(configurationPath, true);
   tarvod::Engine& engine = *enginePointer;
   size_t count = 0;
   engine.swapRulebase(engine.loadRules(options.rulesPath, &count));

@@ -279,16 +279,17 @@ void SendEmailAction::setPrograms(MailPrograms programs) {
   mPrograms = std::move(programs);
 }
 
-int SendEmailAction::send(const plist::Dictionary& action, const FiredRule& rule,
-                          Context& context) {
+std::optional<std::vector<SendEmailAction::Mail>> SendEmailAction::mails(
+    const plist::Dictionary& action, const FiredRule& rule, Context& context) const {
   const std::optional<plist::Array> to = RecipientList(action, "recipientAddresses", rule, context);
-  if (!to) return 1;
+  if (!to) return std::nullopt;
   const std::optional<plist::Array> cc = RecipientList(action, "ccAddresses", rule, context);
-  if (!cc) return 1;
+  if (!cc) return std::nullopt;
+  std::vector<Mail> mails;
   if (to->empty() && cc->empty()) {
     LogMessage(3, "Skipping sending mail message because there are no recipients\n%s",
                context.shownValue(plist::Value(action)).c_str());
-    return 0;
+    return mails;
   }
   const std::string relayHost = ResolvedSetting(action, "relayHost", rule, context);
   const std::string sender = ResolvedSetting(action, "adminEmail", rule, context);
@@ -301,19 +302,18 @@ int SendEmailAction::send(const plist::Dictionary& action, const FiredRule& rule
 
   const std::string bundle = StringKey(action, "localizationBundlePath");
   const std::string table = StringKey(action, "localizationTable");
-  int result = 0;
   for (const std::string& language : languages) {
     LogMessage(3, "\tProcessing language %s using bundle %s and table %s", language.c_str(),
                bundle.c_str(), table.c_str());
     const auto message = LocalizedText(action, "message", language, bundle, table, rule, context);
-    if (!message) return 1;
+    if (!message) return std::nullopt;
     Mail mail;
     mail.message = message->value_or("");
     if (mShortMessage) {
       mail.message = ShortMessageBody(mail.message);
     } else {
       const auto subject = LocalizedText(action, "subject", language, bundle, table, rule, context);
-      if (!subject) return 1;
+      if (!subject) return std::nullopt;
       mail.subject = *subject;
     }
     if (const auto found = toGroups.find(language); found != toGroups.end())
@@ -322,10 +322,40 @@ int SendEmailAction::send(const plist::Dictionary& action, const FiredRule& rule
       mail.cc = found->second;
     mail.sender = sender;
     mail.relayHost = relayHost;
+    mails.push_back(std::move(mail));
+  }
+  return mails;
+}
+
+int SendEmailAction::send(const plist::Dictionary& action, const FiredRule& rule,
+                          Context& context) {
+  std::optional<std::vector<Mail>> mails = this->mails(action, rule, context);
+  if (!mails) return 1;
+  int result = 0;
+  for (Mail& mail : *mails) {
     const int status = submit(std::move(mail), context);
     if (status != 0) result = status;
   }
   return result;
+}
+
+std::optional<std::string> SendEmailAction::describe(const plist::Dictionary& action,
+                                                     const FiredRule& rule, Context& context) {
+  const std::optional<std::vector<Mail>> mails = this->mails(action, rule, context);
+  if (!mails) return std::nullopt;
+  if (mails->empty()) return std::string("would send nothing: there are no recipients");
+  std::string out;
+  for (const Mail& mail : *mails) {
+    if (!out.empty()) out += "\n    ";
+    out += "would mail " + Joined(RemoveRepeatedAddresses(mail.to), ", ");
+    if (!mail.cc.empty()) out += " (Cc " + Joined(RemoveRepeatedAddresses(mail.cc), ", ") + ")";
+    out += mail.relayHost.empty() ? " with the local mail program"
+                                  : " through the relay host " + mail.relayHost;
+    if (!mail.relayHost.empty() && !mail.sender.empty()) out += " from " + mail.sender;
+    if (mail.subject) out += ", subject \"" + *mail.subject + "\"";
+    out += ": " + mail.message;
+  }
+  return context.shownText(out);
 }
 
 int SendEmailAction::submit(Mail mail, const Context& context) {

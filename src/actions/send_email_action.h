@@ -33,6 +33,9 @@ class SendEmailAction final : public Action {
   // 0: nothing sent or every program exited with 0; 1: the action was aborted; otherwise the
   // last non-zero status of a mail program.
   int send(const plist::Dictionary& action, const FiredRule& rule, Context& context);
+  // The recipients, sender, subject and message of each mail it would send.
+  std::optional<std::string> describe(const plist::Dictionary& action, const FiredRule& rule,
+                                      Context& context) override;
 
   // Any thread.
   void setPrograms(MailPrograms programs);
@@ -48,6 +51,9 @@ class SendEmailAction final : public Action {
     std::string message;
     std::string relayHost;
   };
+  // One mail per language; nullopt when the action is aborted (logged).
+  std::optional<std::vector<Mail>> mails(const plist::Dictionary& action, const FiredRule& rule,
+                                         Context& context) const;
   // context only shows the traces with keychain passwords masked.
   int submit(Mail mail, const Context& context);
 
