@@ -41,12 +41,11 @@ std::optional<Tail> SplitTail(std::string_view line) {
     std::string_view digits = line.substr(at + 6);
     const size_t end = digits.find(' ');
     digits = digits.substr(0, end);
+    // At most five digits, so the value is computed only when it fits.
     int64_t port = 0;
-    bool numeric = !digits.empty() && digits.size() <= 5;
-    for (char c : digits) {
-      numeric = numeric && c >= '0' && c <= '9';
-      port = port * 10 + (c - '0');
-    }
+    const bool numeric = !digits.empty() && digits.size() <= 5 &&
+                         digits.find_first_not_of("0123456789") == std::string_view::npos;
+    for (char c : numeric ? digits : std::string_view()) port = port * 10 + (c - '0');
     if (numeric) {
       tail.port = port;
       rest = line.substr(0, at);
