@@ -34,6 +34,11 @@ diff <(echo "$want") <(echo "$actual") || fail "installed files differ (- expect
 
 for b in usr/sbin/tarvod usr/bin/tarvodctl usr/libexec/tarvod/femail; do [ -x "$tmp/root/$b" ] || fail "$b not executable"; done
 grep -qx 'ExecStart=/usr/sbin/tarvod' "$tmp/root/lib/systemd/system/tarvod.service" || fail "unit ExecStart"
+# The binaries carry the version the package's changelog gives.
+version=$(sed -n '1s/^tarvod (\([^)]*\)).*/\1/p' "$(dirname "$0")/../debian/changelog")
+for b in usr/sbin/tarvod usr/bin/tarvodctl; do
+  [ "$("$tmp/root/$b" --version)" = "$(basename "$b") $version" ] || fail "$b --version"
+done
 bash -n "$tmp/root/usr/share/bash-completion/completions/tarvodctl" || fail "completion syntax"
 
 # The default configuration is a property list the daemon reads, comments and all: given an

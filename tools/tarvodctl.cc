@@ -301,6 +301,10 @@ bool IsKeychainCommand(const std::vector<std::string>& args) {
 int main(int argc, char** argv) {
   const std::vector<std::string> args(argv + 1, argv + argc);
   if (!args.empty() && (args[0] == "--help" || args[0] == "-h")) return Usage(stdout);
+  if (args.size() == 1 && args[0] == "--version") {
+    std::printf("tarvodctl %s\n", TARVOD_VERSION);
+    return 0;
+  }
   // check and test: -c may stand before or after the command word.
   for (size_t i = 0; i < args.size(); i += args[i] == "-c" ? 2 : 1) {
     if (args[i] == "-c") continue;

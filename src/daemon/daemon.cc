@@ -2,6 +2,7 @@
 
 #include <cerrno>
 #include <cstdio>
+#include <cstring>
 
 #include "actions/log_action.h"
 #include "context/keychain.h"
@@ -78,6 +79,10 @@ Daemon::~Daemon() {
 
 std::optional<int> Daemon::startup(int argc, char** argv) {
   plist::Dictionary globals;
+  if (argc == 2 && std::strcmp(argv[1], "--version") == 0) {
+    std::printf("tarvod %s\n", TARVOD_VERSION);
+    return 0;
+  }
   InstallSignalHandlers();
   const std::optional<Options> options = ParseOptions(argc, argv);
   if (!options) {
