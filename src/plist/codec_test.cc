@@ -299,6 +299,8 @@ TEST(PropertyListHostile, InvalidUtf8AndNulReadAsNoValue) {
                   "a\0b"s}),  // NUL that libplist would cut the string at
       BinaryList({"\x61\x00\x00"s}),
       "<plist><string>a\0b</string></plist>"s,  // a raw NUL no writer could write again
+      "\"a\0b\";"s,
+      "( \"a\\U0000b\" )",
   };
   for (const std::string& bytes : cases) EXPECT_FALSE(ReadPropertyList(bytes)) << bytes;
 }

@@ -343,7 +343,9 @@ class TextReader {
           }
       }
     }
-    if (!IsValidUtf8(out)) return std::nullopt;
+    // No NUL, raw or escaped: as in the other readers, a text value never holds one, since
+    // the XML writer could not write it again.
+    if (out.find('\0') != std::string::npos || !IsValidUtf8(out)) return std::nullopt;
     return out;
   }
 
