@@ -19,32 +19,9 @@ namespace {
 using tarvod::Problem;
 
 std::string JsonString(std::string_view text) {
-  std::string out = "\"";
-  for (const char c : text) {
-    switch (c) {
-      case '"':
-        out += "\\\"";
-        break;
-      case '\\':
-        out += "\\\\";
-        break;
-      case '\n':
-        out += "\\n";
-        break;
-      case '\t':
-        out += "\\t";
-        break;
-      default:
-        if (static_cast<unsigned char>(c) < 0x20) {
-          char escape[8];
-          std::snprintf(escape, sizeof escape, "\\u%04x", c);
-          out += escape;
-        } else {
-          out.push_back(c);
-        }
-    }
-  }
-  return out + "\"";
+  std::string out;
+  plist::AppendEscapedString(out, text);  // its escapes are JSON's
+  return out;
 }
 
 struct RulesOptions {
