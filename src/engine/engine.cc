@@ -28,66 +28,60 @@ namespace {
 constexpr size_t kMaxEventTypeBytes = 1024;
 constexpr size_t kMaxEventTypeComponents = 64;
 
-// The prefixes of a type, longest first: "a.b.c", "a.b", "a", as views of the type itself.
-// Empty components count, so "a..b" yields "a..b", "a.", "a".
-std::vector<std::string_view> TypePrefixes(std::string_view type) {
-  std::vector<std::string_view> prefixes{type};
+// Calls visit with each prefix of a type, longest first: "a.b.c", "a.b", "a", as views of the
+// type itself. Empty components count, so "a..b" yields "a..b", "a.", "a".
+template <typename Visit>
+void ForEachTypePrefix(std::string_view type, Visit visit) {
+  visit(type);
   for (size_t dot = type.rfind('.'); dot != std::string_view::npos;
        dot = dot == 0 ? std::string_view::npos : type.rfind('.', dot - 1)) {
-    prefixes.push_back(type.substr(0, dot));
+    visit(type.substr(0, dot));
   }
-  return prefixes;
 }
 
-void QueuePrefix(SerialQueue& queue, double now, std::string_view prefix,
-                 const RulebaseEntry& entry, const std::shared_ptr<const plist::Dictionary>& event,
-                 const RulebasePtr& rulebase, const VariableStorePtr& variables,
-                 const std::shared_ptr<Keychain>& keychain, DryRun* dryRun) {
-  LogMessage(2, "  Processing event: %.*s", static_cast<int>(prefix.size()), prefix.data());
-  auto context = std::make_shared<Context>(variables, rulebase, *event, keychain);
+// The one job of a type prefix that has rules: its rules in load order, then its record. The
+// context is made here, on the processing queue, so the copies it holds are made, used and
+// freed by one thread; the counter was taken at dispatch, so counts follow dispatch order.
+// On the serial queue the rules of one event's prefix run back to back, as they would as
+// separate jobs queued together.
+struct PrefixJob {
+  std::shared_ptr<const plist::Dictionary> event;
+  RulebasePtr rulebase;  // keeps entry and its key alive
+  const std::pair<const std::string, RulebaseEntry>* entry;
+  uint64_t count;
+  double now;
+  VariableStorePtr variables;
+  std::shared_ptr<Keychain> keychain;
+  DryRun* dryRun;
 
-  // The counter runs in the rulebase entry, so "prefix:eventCounter" counts the events of
-  // this prefix since the rules were loaded (a reload starts a new rulebase at 0); the
-  // context's copy is the count including this event. A dry run leaves both alone.
-  uint64_t count = entry.eventCounter.load(std::memory_order_relaxed) + 1;
-  if (dryRun == nullptr) {
-    count = entry.eventCounter.fetch_add(1, std::memory_order_relaxed) + 1;
-    entry.lastEventTimestamp.store(now, std::memory_order_relaxed);
-  } else {
-    queue.async([dryRun, prefix = std::string(prefix), n = entry.rules.size()] {
-      dryRun->note("type prefix %s: %zu rules", prefix.c_str(), n);
-    });
-  }
-  const std::string name(prefix);
-  context->eventMetadata().set(name + ":eventCounter",
-                               plist::Value::Integer(static_cast<int64_t>(count)));
-  context->eventMetadata().set(name + ":lastEventTimestamp", plist::Value::Real(now));
+  void operator()() const {
+    const std::string& prefix = entry->first;
+    const std::vector<RulePtr>& rules = entry->second.rules;
+    if (dryRun) dryRun->note("type prefix %s: %zu rules", prefix.c_str(), rules.size());
+    Context context(variables, rulebase, *event, keychain);
+    plist::Dictionary& metadata = context.eventMetadata();
+    metadata.reserve(2);
+    metadata.set(prefix + ":eventCounter", plist::Value::Integer(static_cast<int64_t>(count)));
+    metadata.set(prefix + ":lastEventTimestamp", plist::Value::Real(now));
 
-  // Each job holds its own reference to its rule; the context keeps the rulebase alive.
-  const std::vector<RulePtr>& rules = entry.rules;
-  auto fired = std::make_shared<std::atomic<bool>>(false);
-  for (const RulePtr& rule : rules) {
-    queue.async([rule, context, fired, dryRun] {
+    bool fired = false;
+    for (const RulePtr& rule : rules) {
       const auto start = std::chrono::steady_clock::now();
-      const bool didFire = ProcessRule(*rule, *context, dryRun);
-      if (didFire) fired->store(true);
+      const bool didFire = ProcessRule(*rule, context, dryRun);
+      fired = fired || didFire;
       if (dryRun == nullptr) {
         const std::chrono::duration<double> spent = std::chrono::steady_clock::now() - start;
         Statistics().ruleRan(*rule, didFire, spent.count());
       }
-    });
-  }
-  if (dryRun) return;
-  // On the serial queue the record job runs after every rule job queued above, which is the
-  // wait on the prefix's rule jobs.
-  const bool hasRules = !rules.empty();
-  queue.async([event, fired, hasRules] {
+    }
+    if (dryRun) return;
     // The record touches no variable: a journal that stops taking records must not keep
     // shutdown from saving the store.
     SerialQueue::BlockingSection blocking;
-    WriteEventRecord(*event, hasRules, hasRules && !fired->load());
-  });
-}
+    const bool hasRules = !rules.empty();
+    WriteEventRecord(*event, hasRules, hasRules && !fired);
+  }
+};
 
 }  // namespace
 
@@ -162,12 +156,22 @@ void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned, 
   // One event shared by every job of this dispatch: the caller's own when it handed it over.
   const auto shared = owned ? std::make_shared<const plist::Dictionary>(std::move(*owned))
                             : std::make_shared<const plist::Dictionary>(event);
-  for (const std::string_view prefix : TypePrefixes(type)) {
+  ForEachTypePrefix(type, [&](std::string_view prefix) {
     auto found = rulebase->find(prefix);
     if (found != rulebase->end()) {
-      QueuePrefix(*mQueue, now, prefix, found->second, shared, rulebase,
-                  dryRun ? dryRun->variables : mVariables, mKeychain, dryRun);
-      continue;
+      LogMessage(2, "  Processing event: %.*s", static_cast<int>(prefix.size()), prefix.data());
+      // The counter runs in the rulebase entry, so "prefix:eventCounter" counts the events of
+      // this prefix since the rules were loaded (a reload starts a new rulebase at 0); the
+      // context's copy is the count including this event. A dry run leaves both alone.
+      const RulebaseEntry& entry = found->second;
+      uint64_t count = entry.eventCounter.load(std::memory_order_relaxed) + 1;
+      if (dryRun == nullptr) {
+        count = entry.eventCounter.fetch_add(1, std::memory_order_relaxed) + 1;
+        entry.lastEventTimestamp.store(now, std::memory_order_relaxed);
+      }
+      mQueue->async(PrefixJob{shared, rulebase, &*found, count, now,
+                              dryRun ? dryRun->variables : mVariables, mKeychain, dryRun});
+      return;
     }
     if (prefix.size() == type.size() && dryRun == nullptr) {
       // The record of a type without rules is written by the processing queue too, in the
@@ -180,7 +184,7 @@ void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned, 
     }
     LogMessage(2, "  Dropping event %.*s because it has no associated rules",
                static_cast<int>(prefix.size()), prefix.data());
-  }
+  });
 }
 
 plist::Dictionary Engine::daemonEvent(const char* type) const {

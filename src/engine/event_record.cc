@@ -1,5 +1,6 @@
 #include "engine/event_record.h"
 
+#include <algorithm>
 #include <array>
 #include <cmath>
 #include <cstdint>
@@ -62,6 +63,7 @@ class Record {
     return mMore.emplace_front(std::move(text));
   }
   std::span<const LogAttributeView> attributes() const { return mAttributes; }
+  void reserve(size_t n) { mAttributes.reserve(std::min(n, kMaxRecordAttributes)); }
 
  private:
   std::vector<LogAttributeView> mAttributes;
@@ -100,6 +102,9 @@ void WriteEventRecord(const plist::Dictionary& event, bool hasRules, bool eventB
   LogMessage(4, "Logging event %s to KVLOG tarvod database", type.c_str());
 
   Record record;
+  // Room for the event's keys, its details and the five the record adds, in one allocation.
+  const plist::Dictionary* lifted = event.findDictionary("eventDetails");
+  record.reserve(event.size() + (lifted ? lifted->size() : 0) + 5);
   for (const auto& [key, value] : event) {
     if (key == "eventDetails") {
       if (const plist::Dictionary* details = value.asDictionary()) {
