@@ -25,10 +25,17 @@ std::optional<std::optional<std::string>> ResolveActionText(const plist::Diction
   const plist::Value* value = action.find(key);
   if (value == nullptr) return std::optional<std::string>();
   ErrorSlot error;
-  const auto resolved =
-      Checked(context.resolveVariablesInString(value->textForm(), rule.filePath, &error), error);
+  // The text is resolved where it stands, and the result's string taken rather than copied.
+  const std::string* text = value->asString();
+  std::string formed;
+  if (text == nullptr) formed = value->textForm();
+  auto resolved = Checked(
+      context.resolveVariablesInString(text ? *text : formed, rule.filePath, &error), error);
   if (!resolved) return std::nullopt;
   if (!*resolved) return std::optional<std::string>();
+  if (std::string* string = (*resolved)->asString()) {
+    return std::optional<std::string>(std::move(*string));
+  }
   return std::optional<std::string>((*resolved)->textForm());
 }
 

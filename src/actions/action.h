@@ -15,8 +15,9 @@ namespace tarvod {
 // The rule an action belongs to, with the keys every handler needs read once.
 struct FiredRule {
   const Rule& rule;
-  std::string name;      // "(null)" when the rule has none
-  std::string filePath;  // empty when the rule has none
+  // Views of the rule's own texts, valid while its actions run.
+  std::string_view name;      // "(null)" when the rule has none
+  std::string_view filePath;  // empty when the rule has none
 };
 
 class Action {

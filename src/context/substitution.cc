@@ -94,7 +94,8 @@ std::optional<plist::Value> Context::resolveVariablesInString(const std::string&
                                                               std::string_view rulesFile,
                                                               ErrorSlot* error) {
   // The shortest reference, "${}", has three characters.
-  if (text.size() < 3) return plist::Value(text);
+  // Without "${" nothing opens, so the text comes back as it is.
+  if (text.size() < 3 || text.find("${") == std::string::npos) return plist::Value(text);
 
   std::string out;
   out.reserve(text.size());
@@ -133,7 +134,10 @@ std::optional<plist::Value> Context::resolveVariablesInString(const std::string&
       // The whole text is this one reference: its value itself, of whatever kind, or nothing.
       if (start == 0 && i == n - 1) return value;
       out.resize(start);
-      if (value) {
+      if (const std::string* string = value ? value->asString() : nullptr) {
+        if (DebugLevel() >= 4) LogMessage(4, "tokenValue is %s", shownText(*string).c_str());
+        out += *string;
+      } else if (value) {
         const std::string inserted = value->textForm();
         if (DebugLevel() >= 4) LogMessage(4, "tokenValue is %s", shownText(inserted).c_str());
         out += inserted;

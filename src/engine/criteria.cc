@@ -177,8 +177,9 @@ const char* KindName(const Value& v) {
 
 bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Context& context,
                      DryRun* dryRun) {
+  static const std::string kNoFile;
   const std::string* path = rule.findString("filePath");
-  const std::string filePath = path ? *path : std::string();
+  const std::string& filePath = path ? *path : kNoFile;
 
   const Value* written = criterion.find("operator");
   std::optional<int> code;
@@ -220,7 +221,9 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
   }
 
   const Value& first = operands[0];
-  if (operands.size() == 1) {
+  // The traces' texts are made only when the traces are written.
+  const bool tracing = DebugLevel() >= 2;
+  if (operands.size() == 1 && tracing) {
     LogMessage(2, "    Evaluating criteria: %s %s", context.shownValue(first).c_str(),
                keyword.c_str());
   }
@@ -228,8 +231,10 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
   const Value* second = nullptr;
   if (*code < 16) {
     second = operands.size() > 1 ? &operands[1] : nullptr;
-    LogMessage(2, "    Evaluating criteria: %s %s %s", context.shownValue(first).c_str(),
-               keyword.c_str(), second ? context.shownValue(*second).c_str() : "(null)");
+    if (tracing) {
+      LogMessage(2, "    Evaluating criteria: %s %s %s", context.shownValue(first).c_str(),
+                 keyword.c_str(), second ? context.shownValue(*second).c_str() : "(null)");
+    }
   }
   const bool passed = Decide(*code, first, second, context, filePath).value_or(false);
   if (dryRun) {

@@ -16,6 +16,16 @@ namespace {
 
 enum class Mode { kAny, kAll, kNone };
 
+// A rule's text entry: the string itself when it is one (no copy per event), else its text
+// form, or absent when there is none, kept in storage.
+const std::string& TextOf(const plist::Value* value, std::string& storage, const char* absent) {
+  if (value != nullptr) {
+    if (const std::string* text = value->asString()) return *text;
+    return storage = value->textForm();
+  }
+  return storage = absent;
+}
+
 // Assigns every entry of a variables dictionary, keys in ascending byte order, so that a value
 // may refer to a name that sorts before it and see the value just set.
 void AssignVariables(const plist::Dictionary& variables, const std::string& filePath,
@@ -59,8 +69,10 @@ void DryRun::note(const char* format, ...) {
 bool ProcessRule(const Rule& rule, Context& context, DryRun* dryRun) {
   const plist::Value* nameValue = rule.find("name");
   const plist::Value* filePathValue = rule.find("filePath");
-  const std::string name = nameValue ? nameValue->textForm() : "(null)";
-  const std::string filePath = filePathValue ? filePathValue->textForm() : std::string();
+  std::string nameStorage;
+  std::string filePathStorage;
+  const std::string& name = TextOf(nameValue, nameStorage, "(null)");
+  const std::string& filePath = TextOf(filePathValue, filePathStorage, "");
   LogMessage(2, "PROCESSING RULE: %s (%s)", name.c_str(),
              filePathValue ? filePath.c_str() : "(null)");
   const RuleMessageScope scope(name, filePath);

@@ -78,6 +78,7 @@ class Value {
 
   // Typed access; nullptr when the value is of another kind.
   const std::string* asString() const { return std::get_if<std::string>(&v_); }
+  std::string* asString() { return std::get_if<std::string>(&v_); }
   const Array* asArray() const { return std::get_if<Array>(&v_); }
   Array* asArray() { return std::get_if<Array>(&v_); }
   const Dictionary* asDictionary() const;
