@@ -15,8 +15,7 @@ std::optional<Options> Parse(std::vector<std::string> args) {
   return ParseOptions(static_cast<int>(args.size()), argv.data());
 }
 
-// The last occurrence of an option wins, options stop at the first operand, and the debug
-// level is a decimal prefix.
+// The last occurrence wins, options stop at the first operand, the level is a decimal prefix.
 TEST(Options, ParsesTheCommandLine) {
   const struct Case {
     std::vector<std::string> args;

@@ -88,8 +88,7 @@ TEST_F(StateTest, RestoreMergesWholeEntriesAndTheStoreWins) {
   EXPECT_EQ(*restored.findDictionary("/rules/a.plist"), (Dictionary{{"n", Value::Integer(7)}}));
 }
 
-// Nothing is restored with saveState 0, which only creates the directory, nor from a file
-// that is no dictionary or not the daemon's own.
+// saveState 0 only creates the directory; a file not wholly the daemon's own is ignored.
 TEST_F(StateTest, RestoresNothingWhenOffOrFromAFileNotWhollyOurs) {
   const Dictionary before = store();
   const std::string path = std::string(kDir) + "/state";

@@ -138,9 +138,8 @@ TEST(AuditRecord, ConvertedEventsReachTheMonitor) {
   EXPECT_EQ(*seen[0].findString("eventType"), "auth.success");
 }
 
-// Random bytes, and mutated and cut copies of a login record and of a record holding every
-// token type, go through the conversion and the token walk. Each is a heap copy of exactly its
-// size, so that the sanitizers see any overrun.
+// Random bytes and mutated, cut records, each on a heap copy of exactly its size so that the
+// sanitizers see any overrun, through the conversion and the token walk.
 TEST(AuditRecord, RandomAndMutatedRecordsNeverCrashOrOverrun) {
   std::mt19937 random(99);
   const Bytes login = RecordBuilder()

@@ -11,8 +11,7 @@ namespace {
 
 using namespace ::tarvod::testing;
 
-// Walked through a record of every type, each token is exactly its own length: the bytes of
-// the token after it are never counted in.
+// In a record of every type, the bytes of the token after one are never counted in.
 TEST(BsmToken, EveryTokenTypeDecodesToExactlyItsOwnLength) {
   Bytes record;
   for (const auto& [name, token] : EveryTokenType()) record = Cat({record, token});

@@ -101,8 +101,7 @@ TEST_F(EventSocketTest, MessagesOnOneConnectionAreEventsWithTheSameSenderTypedOr
   }
 }
 
-// Malformed and oversize packets are dropped and the connection stays; a message that is no
-// dictionary closes it.
+// Malformed and oversize packets are dropped; a message that is no dictionary ends the link.
 TEST_F(EventSocketTest, BadPacketsAreDroppedAndANonDictionaryClosesTheConnection) {
   start();
   Client client(mPath);

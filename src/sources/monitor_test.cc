@@ -75,8 +75,7 @@ TEST(FilterBySourceUID, AdmitsASenderWhoseUserOrGroupIsListed) {
   }
 }
 
-// The rejected sender's log line and the missing audit pipe are checked against the daemon in
-// tests/.
+// The rejected sender's line and the missing audit pipe are checked on the daemon in tests/.
 TEST(Monitor, ProcessEventLogsTheEventAndDispatchesIt) {
   testing::LogCapture capture(3);
   EventCollector collector;
