@@ -50,15 +50,18 @@ class LogActionTest : public ::testing::Test {
   std::unique_ptr<Context> context_;
 };
 
-TEST_F(LogActionTest, AppendsTheMessageAndOneNewlineToTheFileByteForByte) {
-  const std::string path = dir_ + "/out.log";
-  WriteAll(path, "existing\n");
-  Run(Dictionary{{"message", "nine char"}, {"logPath", path}});
-  Run(Dictionary{{"message", "two\nlines ${global:who} 100%s%n \\:"}, {"logPath", path}});
-  EXPECT_EQ(testing::ReadWholeFile(path), "existing\nnine char\ntwo\nlines root 100%s%n :\n");
-}
-
-TEST_F(LogActionTest, CreatesAMissingFileWithMode0644) {
+// Kept open or not, the same bytes: the message and one newline, appended.
+TEST_F(LogActionTest, AppendsTheMessageByteForByteOrCreatesTheFileWithMode0644) {
+  for (const bool keep : {false, true}) {
+    SCOPED_TRACE(keep);
+    SetKeepLogFilesOpen(keep);
+    const std::string path = dir_ + (keep ? "/kept.log" : "/out.log");
+    WriteAll(path, "existing\n");
+    Run(Dictionary{{"message", "nine char"}, {"logPath", path}});
+    Run(Dictionary{{"message", "two\nlines ${global:who} 100%s%n \\:"}, {"logPath", path}});
+    EXPECT_EQ(testing::ReadWholeFile(path), "existing\nnine char\ntwo\nlines root 100%s%n :\n");
+  }
+  SetKeepLogFilesOpen(false);
   const mode_t mask = umask(0);
   Run(Dictionary{{"message", "m"}, {"logPath", "${global:file}"}});
   umask(mask);
@@ -92,25 +95,20 @@ TEST_F(LogActionTest, ReportsAFileThatCannotBeOpened) {
   SetKeepLogFilesOpen(false);
 }
 
-// keepLogFilesOpen writes the same bytes, and follows a rotation by renaming at the next batch
-// or after a reload, and one by copying and truncating at once.
-TEST_F(LogActionTest, KeptFilesWriteTheSameBytesAndFollowTheirPath) {
+// A kept file follows a rotation by renaming at the next batch or after a reload, and one by
+// copying and truncating at once.
+TEST_F(LogActionTest, KeptFilesFollowTheirPath) {
   SetKeepLogFilesOpen(true);
   const std::string path = dir_ + "/kept.log";
   const auto line = [&](const std::string& message) {
     Run(Dictionary{{"message", message}, {"logPath", path}});
   };
-  WriteAll(path, "existing\n");
-  line("nine char");
-  line("two\nlines ${global:who}");
-  EXPECT_EQ(testing::ReadWholeFile(path), "existing\nnine char\ntwo\nlines root\n");
-
+  line("first");
   ASSERT_EQ(rename(path.c_str(), (path + ".1").c_str()), 0);
   line("same batch");  // the path is looked up once per batch
   EndLogBatch();
   line("next batch");
-  EXPECT_EQ(testing::ReadWholeFile(path + ".1"),
-            "existing\nnine char\ntwo\nlines root\nsame batch\n");
+  EXPECT_EQ(testing::ReadWholeFile(path + ".1"), "first\nsame batch\n");
   EXPECT_EQ(testing::ReadWholeFile(path), "next batch\n");
 
   ASSERT_EQ(rename(path.c_str(), (path + ".2").c_str()), 0);

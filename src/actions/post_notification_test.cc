@@ -35,7 +35,7 @@ class PostNotificationTest : public ::testing::Test {
   std::unique_ptr<Context> context_;
 };
 
-TEST_F(PostNotificationTest, PostsTheEventAsTheContextHoldsItUnderTheResolvedName) {
+TEST_F(PostNotificationTest, PostsTheEventUnderTheResolvedNameWithDetailsInThePostOnly) {
   const auto posted = Post(Dictionary{{"name", "alert.${global:who}"}, {"message", "x\\:y"}});
   ASSERT_EQ(posted.size(), 1u);
   EXPECT_EQ(posted[0].name, "alert.root");
@@ -47,17 +47,16 @@ TEST_F(PostNotificationTest, PostsTheEventAsTheContextHoldsItUnderTheResolvedNam
       capture_.text(), {"DoNotificationAction (unresolved): name = alert.${global:who} message = "
                         "x\\:y details = (null)",
                         "DoNotificationAction: name = alert.root message = x\\:y details = {"}));
-}
 
-TEST_F(PostNotificationTest, DetailsReplaceEventEntriesInThePostOnly) {
-  const auto posted =
+  // Details replace event entries in the post only.
+  const auto relayed =
       Post(Dictionary{{"name", "n"},
                       {"message", "m"},
                       {"details", Dictionary{{"eventType", "relayed"}, {"by", "${global:who}"}}}});
-  ASSERT_EQ(posted.size(), 1u);
-  EXPECT_EQ(*posted[0].userInfo->findString("eventType"), "relayed");
-  EXPECT_EQ(*posted[0].userInfo->findString("by"), "root");
-  EXPECT_EQ(*posted[0].userInfo->findString("clientIP"), "10.0.0.1");
+  ASSERT_EQ(relayed.size(), 2u);
+  EXPECT_EQ(*relayed[1].userInfo->findString("eventType"), "relayed");
+  EXPECT_EQ(*relayed[1].userInfo->findString("by"), "root");
+  EXPECT_EQ(*relayed[1].userInfo->findString("clientIP"), "10.0.0.1");
   EXPECT_EQ(*context_->event()->findString("eventType"), "auth.failure");
 }
 

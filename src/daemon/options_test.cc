@@ -15,33 +15,31 @@ std::optional<Options> Parse(std::vector<std::string> args) {
   return ParseOptions(static_cast<int>(args.size()), argv.data());
 }
 
-TEST(Options, DefaultsAndTheLastOccurrenceOfEachOption) {
-  const std::optional<Options> defaults = Parse({});
-  ASSERT_TRUE(defaults);
-  EXPECT_EQ(defaults->configurationPath, "/etc/tarvod.d/tarvod.plist");
-  EXPECT_EQ(defaults->rulesPath, std::nullopt);
-  EXPECT_EQ(defaults->debugLevel, 0);
-  EXPECT_TRUE(defaults->restoreState);
-
-  const std::optional<Options> given = Parse({"-c", "a", "-r", "b", "-r", "c", "-n", "-v", "3"});
-  ASSERT_TRUE(given);
-  EXPECT_EQ(given->configurationPath, "a");
-  EXPECT_EQ(given->rulesPath, "c");
-  EXPECT_EQ(given->debugLevel, 3);
-  EXPECT_FALSE(given->restoreState);
-}
-
-TEST(Options, OptionsStopAtTheFirstOperandAndAnEmptyRulesPathIsKept) {
-  const std::optional<Options> options = Parse({"-c", "a", "-r", "b", "extra", "-r", "c"});
-  ASSERT_TRUE(options);
-  EXPECT_EQ(options->rulesPath, "b");
-  EXPECT_EQ(Parse({"-r", ""})->rulesPath, "");
-}
-
-TEST(Options, DebugLevelIsADecimalPrefix) {
-  for (const auto& [text, level] : std::vector<std::pair<std::string, int64_t>>{
-           {" +4x", 4}, {"-1", -1}, {"abc", 0}, {"12", 12}}) {
-    EXPECT_EQ(Parse({"-v", text})->debugLevel, level) << text;
+// The last occurrence wins, options stop at the first operand, the level is a decimal prefix.
+TEST(Options, ParsesTheCommandLine) {
+  const struct Case {
+    std::vector<std::string> args;
+    std::string configuration;
+    std::optional<std::string> rules;
+    int64_t debugLevel;
+    bool restore;
+  } cases[] = {
+      {{}, "/etc/tarvod.d/tarvod.plist", std::nullopt, 0, true},
+      {{"-c", "a", "-r", "b", "-r", "c", "-n", "-v", "3"}, "a", "c", 3, false},
+      {{"-c", "a", "-r", "b", "extra", "-r", "c"}, "a", "b", 0, true},
+      {{"-r", ""}, "/etc/tarvod.d/tarvod.plist", "", 0, true},
+      {{"-v", " +4x"}, "/etc/tarvod.d/tarvod.plist", std::nullopt, 4, true},
+      {{"-v", "-1"}, "/etc/tarvod.d/tarvod.plist", std::nullopt, -1, true},
+      {{"-v", "abc"}, "/etc/tarvod.d/tarvod.plist", std::nullopt, 0, true},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(::testing::PrintToString(c.args));
+    const std::optional<Options> options = Parse(c.args);
+    ASSERT_TRUE(options);
+    EXPECT_EQ(options->configurationPath, c.configuration);
+    EXPECT_EQ(options->rulesPath, c.rules);
+    EXPECT_EQ(options->debugLevel, c.debugLevel);
+    EXPECT_EQ(options->restoreState, c.restore);
   }
 }
 

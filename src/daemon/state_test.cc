@@ -78,16 +78,6 @@ TEST_F(StateTest, SavesReplaceStateAndKeepTheReplacedCopyAsStatePrev) {
   EXPECT_EQ(capture_.text(), "");
 }
 
-TEST_F(StateTest, SaveStateZeroCreatesTheDirectoryOnlyAndRestoresNothing) {
-  files_.files[std::string(kDir) + "/state"] = Xml(Dictionary{{"/rules/b", Dictionary{}}});
-  const Dictionary before = store();
-  RestoreState(Config(0), engine_, files_);
-  EXPECT_EQ(store(), before);
-  SaveState(Config(0), engine_, files_);
-  EXPECT_TRUE(files_.directories.contains(kDir));
-  EXPECT_EQ(files_.files.size(), 1u);
-}
-
 TEST_F(StateTest, RestoreMergesWholeEntriesAndTheStoreWins) {
   files_.files[std::string(kDir) + "/state"] =
       Xml(Dictionary{{"_globals", Dictionary{{"g", "saved"}, {"h", "saved"}}},
@@ -98,9 +88,17 @@ TEST_F(StateTest, RestoreMergesWholeEntriesAndTheStoreWins) {
   EXPECT_EQ(*restored.findDictionary("/rules/a.plist"), (Dictionary{{"n", Value::Integer(7)}}));
 }
 
-TEST_F(StateTest, AStateFileThatIsNoDictionaryOrNotOursRestoresNothing) {
+// saveState 0 only creates the directory; a file not wholly the daemon's own is ignored.
+TEST_F(StateTest, RestoresNothingWhenOffOrFromAFileNotWhollyOurs) {
   const Dictionary before = store();
   const std::string path = std::string(kDir) + "/state";
+  files_.files[path] = Xml(Dictionary{{"/rules/b", Dictionary{}}});
+  RestoreState(Config(0), engine_, files_);
+  EXPECT_EQ(store(), before);
+  SaveState(Config(0), engine_, files_);
+  EXPECT_TRUE(files_.directories.contains(kDir));
+  EXPECT_EQ(files_.files.size(), 1u);
+
   for (const std::string& bytes : {*plist::WriteXmlPropertyList(Value(plist::Array{Value("x")})),
                                    std::string("not a property list"), std::string()}) {
     files_.files[path] = bytes;

@@ -35,9 +35,10 @@ class EventSocketTest : public ::testing::Test {
     mMonitor.reset();
     std::filesystem::remove_all(mDirectory);
   }
-  Monitor& start(bool backPressure = false) {
+  Monitor& start(bool backPressure = false, int idleSeconds = 0) {
     mMonitor = std::make_unique<Monitor>(mCollector.hooks(backPressure));
     mMonitor->setEventSocketPath(mPath);
+    if (idleSeconds > 0) mMonitor->setConnectionIdleTimeout(idleSeconds);
     mMonitor->beginListening();
     return *mMonitor;
   }
@@ -64,47 +65,62 @@ TEST(ConvertXPCEvent, StampsSenderIdsAsSignedDecimalUnlessTheSenderSetThem) {
   EXPECT_EQ(*kept->findString("senderGID"), "20");
 }
 
-TEST_F(EventSocketTest, SocketIsCreatedWithItsDirectoryAndOpenToEveryone) {
-  start();
+TEST_F(EventSocketTest, SocketIsOpenToEveryoneAndRemovedAtStopAfterWhatWasRead) {
+  Monitor& monitor = start();
   struct stat socketStat, directoryStat;
   ASSERT_EQ(lstat(mPath.c_str(), &socketStat), 0);
   EXPECT_TRUE(S_ISSOCK(socketStat.st_mode));
   EXPECT_EQ(socketStat.st_mode & 0777, 0666u);
   ASSERT_EQ(stat((mDirectory + "/run").c_str(), &directoryStat), 0);
   EXPECT_EQ(directoryStat.st_mode & 0777, 0755u);
-  mMonitor->stopListening();
-  EXPECT_FALSE(std::filesystem::exists(mPath)) << "the socket file is removed at stop";
+  Client client(mPath);
+  for (int i = 0; i < 50; ++i) ASSERT_TRUE(client.send(EventXml("before.stop")));
+  ASSERT_TRUE(mCollector.waitFor(50));
+  monitor.stopListening();
+  EXPECT_FALSE(std::filesystem::exists(mPath));
+  EXPECT_FALSE(Client(mPath).connected());
+  client.send(EventXml("after.stop"));  // may fail: the daemon's end is gone
+  usleep(100'000);
+  EXPECT_EQ(mCollector.size(), 50u);
 }
 
-TEST_F(EventSocketTest, ThreeMessagesOnOneConnectionAreThreeEventsWithTheSameSender) {
+TEST_F(EventSocketTest, MessagesOnOneConnectionAreEventsWithTheSameSenderTypedOrNot) {
   start();
   Client client(mPath);
   ASSERT_TRUE(client.connected());
   for (const char* type : {"a.one", "a.two", "a.three"}) ASSERT_TRUE(client.send(EventXml(type)));
-  ASSERT_TRUE(mCollector.waitFor(3));
+  ASSERT_TRUE(client.send(XmlPlist("<dict><key>note</key><string>n</string></dict>")));
+  ASSERT_TRUE(mCollector.waitFor(4));
   const auto events = mCollector.events();
   EXPECT_EQ(*events[0].findString("eventType"), "a.one");
   EXPECT_EQ(*events[2].findString("eventType"), "a.three");
+  EXPECT_FALSE(events[3].contains("eventType"));
   for (const auto& event : events) {
     EXPECT_EQ(*event.findString("senderUID"), std::to_string(getuid()));
     EXPECT_EQ(*event.findString("senderGID"), std::to_string(getgid()));
   }
 }
 
-TEST_F(EventSocketTest, MalformedAndOversizePacketsAreDroppedAndTheConnectionStays) {
+// Malformed and oversize packets are dropped; a message that is no dictionary ends the link.
+TEST_F(EventSocketTest, BadPacketsAreDroppedAndANonDictionaryClosesTheConnection) {
   start();
   Client client(mPath);
   ASSERT_TRUE(client.send("this is no property list"));
   ASSERT_TRUE(client.send(""));
   ASSERT_TRUE(client.send("<plist><dict><key>unterminated"));
-  std::string oversize = EventXml(
-      "too.big", "<key>pad</key><string>" + std::string(kMaxEventMessageBytes, 'p') + "</string>");
-  ASSERT_TRUE(client.send(oversize));
+  ASSERT_TRUE(
+      client.send(EventXml("too.big", "<key>pad</key><string>" +
+                                          std::string(kMaxEventMessageBytes, 'p') + "</string>")));
   ASSERT_TRUE(client.send(EventXml("after.malformed")));
-  ASSERT_TRUE(mCollector.waitFor(1));
+  ASSERT_TRUE(client.send(XmlPlist("<string>just text</string>")));
+  char byte;
+  EXPECT_EQ(recv(client.fd(), &byte, 1, 0), 0);  // the daemon closed its end
+  Client other(mPath);
+  ASSERT_TRUE(other.send(EventXml("still.listening")));
+  ASSERT_TRUE(mCollector.waitFor(2));
   settle();
   const auto events = mCollector.events();
-  ASSERT_EQ(events.size(), 1u);
+  ASSERT_EQ(events.size(), 2u);
   EXPECT_EQ(*events[0].findString("eventType"), "after.malformed");
 }
 
@@ -137,10 +153,7 @@ TEST_F(EventSocketTest, EveryPacketSentBeforeTheSenderClosesIsHandled) {
 
 TEST_F(EventSocketTest, AConnectionThatSendsNothingIsClosedAfterTheIdleTimeout) {
   ::tarvod::testing::LogCapture capture(1);
-  mMonitor = std::make_unique<Monitor>(mCollector.hooks());
-  mMonitor->setEventSocketPath(mPath);
-  mMonitor->setConnectionIdleTimeout(1);
-  mMonitor->beginListening();
+  start(false, 1);
   Client idle(mPath);
   Client busy(mPath);
   ASSERT_TRUE(busy.send(EventXml("busy.first")));
@@ -162,58 +175,30 @@ TEST_F(EventSocketTest, AConnectionThatSendsNothingIsClosedAfterTheIdleTimeout) 
       << capture.text();
 }
 
-TEST_F(EventSocketTest, ANonDictionaryMessageClosesTheConnection) {
-  start();
-  Client client(mPath);
-  ASSERT_TRUE(client.send(XmlPlist("<string>just text</string>")));
-  // The daemon closes its end: a read on ours sees the end of the stream.
-  char byte;
-  EXPECT_EQ(recv(client.fd(), &byte, 1, 0), 0);
-  Client other(mPath);
-  ASSERT_TRUE(other.send(EventXml("still.listening")));
-  ASSERT_TRUE(mCollector.waitFor(1));
-  EXPECT_EQ(mCollector.size(), 1u);
-}
-
-TEST_F(EventSocketTest, ADictionaryWithoutEventTypeIsPassedOn) {
-  start();
-  Client client(mPath);
-  ASSERT_TRUE(client.send(XmlPlist("<dict><key>note</key><string>n</string></dict>")));
-  ASSERT_TRUE(mCollector.waitFor(1));
-  EXPECT_FALSE(mCollector.events()[0].contains("eventType"));
-}
-
-TEST_F(EventSocketTest, AStaleSocketFileIsReplaced) {
+// A socket file left by a crash is replaced; a live socket or anything else is left alone.
+TEST_F(EventSocketTest, OnlyAStaleSocketFileAtThePathIsReplaced) {
   std::filesystem::create_directories(mDirectory + "/run");
-  {
-    SocketResult stale = ListenSeqpacket(mPath, 1);
-    ASSERT_GE(stale.fd, 0);
-    close(stale.fd);  // the file stays behind, as after a crash
-  }
+  SocketResult live = ListenSeqpacket(mPath, 1);
+  ASSERT_GE(live.fd, 0);
+  Monitor* monitor = &start();
+  EXPECT_EQ(monitor->SetXPCListenerFor(*monitor->inputQueue()), -1);
+  mMonitor.reset();
+  close(live.fd);  // the file stays behind, as after a crash
+  ASSERT_TRUE(std::filesystem::is_socket(mPath));
   start();
   Client client(mPath);
   ASSERT_TRUE(client.send(EventXml("after.stale")));
   EXPECT_TRUE(mCollector.waitFor(1));
-}
+  mMonitor.reset();
 
-TEST_F(EventSocketTest, APathHoldingSomethingElseIsLeftAloneAndTheListenerFails) {
-  std::filesystem::create_directories(mDirectory + "/run");
+  std::filesystem::remove(mPath);
   std::ofstream(mPath) << "precious";
-  Monitor& monitor = start();
-  EXPECT_EQ(monitor.SetXPCListenerFor(*monitor.inputQueue()), -1);
+  monitor = &start();
+  EXPECT_EQ(monitor->SetXPCListenerFor(*monitor->inputQueue()), -1);
   std::ifstream in(mPath);
   std::string content;
   in >> content;
   EXPECT_EQ(content, "precious");
-}
-
-TEST_F(EventSocketTest, ASocketAnotherProcessListensOnIsNotTakenOver) {
-  std::filesystem::create_directories(mDirectory + "/run");
-  SocketResult live = ListenSeqpacket(mPath, 1);
-  ASSERT_GE(live.fd, 0);
-  Monitor& monitor = start();
-  EXPECT_EQ(monitor.SetXPCListenerFor(*monitor.inputQueue()), -1);
-  close(live.fd);
 }
 
 TEST_F(EventSocketTest, ConnectionsBeyondTheLimitWaitUntilOneCloses) {
@@ -272,18 +257,6 @@ TEST_F(EventSocketTest, SuspendStopsAcceptingButServesAcceptedConnections) {
   monitor.resume();
   ASSERT_TRUE(mCollector.waitFor(3));
   EXPECT_EQ(*mCollector.events()[2].findString("eventType"), "late");
-}
-
-TEST_F(EventSocketTest, StopListeningDeliversWhatWasReadAndClosesEveryConnection) {
-  Monitor& monitor = start();
-  Client client(mPath);
-  for (int i = 0; i < 50; ++i) ASSERT_TRUE(client.send(EventXml("before.stop")));
-  ASSERT_TRUE(mCollector.waitFor(50));
-  monitor.stopListening();
-  EXPECT_FALSE(Client(mPath).connected());
-  client.send(EventXml("after.stop"));  // may fail: the daemon's end is gone
-  usleep(100'000);
-  EXPECT_EQ(mCollector.size(), 50u);
 }
 
 }  // namespace

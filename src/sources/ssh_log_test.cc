@@ -78,15 +78,17 @@ TEST(SshLogLine, OtherLinesAndLinesWithoutAnAddressAreNoLogin) {
 TEST(SshLogLine, TheEventCarriesTheDetailsOfTheAttempt) {
   const std::string message = "Failed password for root from 192.0.2.7 port 4 ssh2";
   const plist::Dictionary event = SshLoginEvent(*ParseSshLogLine(message), message, 12.5);
-  EXPECT_EQ(*event.findString("eventType"), "auth.failure");
-  EXPECT_EQ(*event.findString("eventSource"), "Journal");
-  EXPECT_EQ(event.find("eventTimestamp")->numberValue(), 12.5);
-  const plist::Dictionary& details = *event.findDictionary("eventDetails");
-  EXPECT_EQ(*details.findString("message"), message);
-  EXPECT_EQ(*details.findString("protocolName"), "SSH");
-  EXPECT_EQ(*details.findString("username"), "root");
-  EXPECT_EQ(details.find("clientPort")->integerValue(), 4);
-  EXPECT_EQ(*details.findString("authMethod"), "password");
+  const plist::Dictionary expected{
+      {"eventType", "auth.failure"},
+      {"eventSource", "Journal"},
+      {"eventTimestamp", plist::Value::Real(12.5)},
+      {"eventDetails", plist::Dictionary{{"clientIP", "192.0.2.7"},
+                                         {"message", message},
+                                         {"protocolName", "SSH"},
+                                         {"username", "root"},
+                                         {"clientPort", plist::Value::Integer(4)},
+                                         {"authMethod", "password"}}}};
+  EXPECT_EQ(event, expected);
 }
 
 }  // namespace
