@@ -104,12 +104,12 @@ void LogToStructuredLog(const plist::Dictionary& action, const std::string& logT
   }
 }
 
-// Seeks to the end of fd and writes the message and one newline with one call (so that no
-// other writer's bytes can come between them); a short write is reported as the two writes of
-// the line would have reported it, and the newline is still attempted. False when any of the
-// line is missing.
-bool WriteLine(int fd, const std::string& path, const std::string& message) {
-  lseek(fd, 0, SEEK_END);
+// Seeks to the end of fd (unless it was opened to append) and writes the message and one
+// newline with one call (so that no other writer's bytes can come between them); a short write
+// is reported as the two writes of the line would have reported it, and the newline is still
+// attempted. False when any of the line is missing.
+bool WriteLine(int fd, const std::string& path, const std::string& message, bool seek = true) {
+  if (seek) lseek(fd, 0, SEEK_END);
   iovec parts[2] = {{const_cast<char*>(message.data()), message.size()},
                     {const_cast<char*>("\n"), 1}};
   errno = 0;
@@ -182,7 +182,9 @@ class KeptFiles {
       file.lastUse = mUses;
       return file.fd;
     }
-    const int fd = OpenLogDestination(path.c_str(), O_CREAT, 0644);
+    // Appending: every line lands at the end without a seek of its own, even after another
+    // writer has added to the file.
+    const int fd = OpenLogDestination(path.c_str(), O_CREAT | O_APPEND, 0644);
     if (fd < 0) return -1;
     struct stat opened {};
     if (fstat(fd, &opened) != 0) {
@@ -236,7 +238,7 @@ KeptFiles& Kept() {
   return *kept;
 }
 
-// The same bytes as LogToFile, into a kept file.
+// The same bytes as LogToFile, into a kept file opened to append.
 void LogToKeptFile(const std::string& path, const std::string& message) {
   KeptFiles& kept = Kept();
   std::lock_guard<std::mutex> guard(kept.lock());
@@ -245,7 +247,7 @@ void LogToKeptFile(const std::string& path, const std::string& message) {
     LogMessage(0, "LOG: Cannot open %s errno = %d", path.c_str(), errno);
     return;
   }
-  if (WriteLine(fd, path, message)) return;
+  if (WriteLine(fd, path, message, false)) return;
   kept.forget(fd);
 }
 
