@@ -93,21 +93,24 @@ TEST_F(DaemonTest, SymbolicLinkAtTheErrorLogPathIsRefusedAndAHardLinkAppendedTo)
   EXPECT_THAT(ReadFile(target), HasSubstr("No rules found"));
 }
 
+// The rules directory is loaded as a directory though its name has an extension; leftovers of
+// editors and package managers beside the rules are not loaded.
 TEST_F(DaemonTest, RulesTreeLoadsEveryRulesFileAtAnyDepth) {
-  dir.write("tree/one.plist", RulesDocument({RuleXml("one", {"a.b"})}));
-  dir.write("tree/nested/deeper/two.plist", RulesDocument({RuleXml("two", {"a.b", "c"})}));
-  dir.write("tree/.hidden/three.plist", RulesDocument({RuleXml("three", {"a.b"})}));
-  dir.write("tree/.four.plist", RulesDocument({RuleXml("four", {"a.b"})}));
-  dir.write("tree/notes.txt", "not a property list");
-  dir.write("tree/dict.plist", PlistDocument(Dict({{"name", Str("x")}})));
-  dir.write("tree/mixed.plist",
+  dir.write("rules.d/one.plist", RulesDocument({RuleXml("one", {"a.b"})}));
+  dir.write("rules.d/nested/deeper/two.plist", RulesDocument({RuleXml("two", {"a.b", "c"})}));
+  dir.write("rules.d/.hidden/three.plist", RulesDocument({RuleXml("three", {"a.b"})}));
+  dir.write("rules.d/.four.plist", RulesDocument({RuleXml("four", {"a.b"})}));
+  dir.write("rules.d/notes.txt", "not a property list");
+  dir.write("rules.d/one.plist.dpkg-old", RulesDocument({RuleXml("old", {"a.b"})}));
+  dir.write("rules.d/dict.plist", PlistDocument(Dict({{"name", Str("x")}})));
+  dir.write("rules.d/mixed.plist",
             RulesDocument(
                 {RuleXml("disabled", {"a.b"}, {{"enabled", Bool(false)}}),
                  Dict({{"name", Str("stringTypes")}, {"eventTypes", Str("a.b")}}), Str("junk"),
                  RuleXml("twice", {"d", "d"}), RuleXml("none", {}),
                  Dict({{"name", Str("oddTypes")},
                        {"eventTypes", Arr({Int(5), Bool(true), Arr({Str("e")}), Str("e")})}})}));
-  Daemon daemon({"-c", writeConfig({{"debugLevel", Int(3)}}), "-r", dir.file("tree")}, dir);
+  Daemon daemon({"-c", writeConfig({{"debugLevel", Int(3)}}), "-r", dir.file("rules.d")}, dir);
   ASSERT_TRUE(daemon.waitForLine(errorLog, "Registered"));
   EXPECT_EQ(daemon.stop(SIGINT), 0);
   const std::string log = ReadFile(errorLog);
@@ -115,36 +118,22 @@ TEST_F(DaemonTest, RulesTreeLoadsEveryRulesFileAtAnyDepth) {
   // one are not.
   EXPECT_THAT(log, HasSubstr("Loaded 7 rules\n"));
   // Only the string among oddTypes' types indexes it; each other entry is named and skipped.
-  const std::string mixed = dir.file("tree/mixed.plist");
+  const std::string mixed = dir.file("rules.d/mixed.plist");
   EXPECT_THAT(log, HasSubstr(mixed + ": rule 6 \"oddTypes\": eventTypes[1]: must be a string, "
                                      "not an integer\n"));
   EXPECT_THAT(log, HasSubstr(mixed + ": rule 3: must be a dictionary, not a string; skipped\n"));
-  EXPECT_THAT(log, HasSubstr(dir.file("tree/dict.plist") +
+  EXPECT_THAT(log, HasSubstr(dir.file("rules.d/dict.plist") +
                              ": the top level is not an array of rules; skipped\n"));
-  EXPECT_THAT(log, HasSubstr("5 files read, 7 rules loaded, 2 files skipped, 8 problems found\n"));
+  EXPECT_THAT(log, HasSubstr("5 files read, 7 rules loaded, 3 files skipped, 9 problems found\n"));
   EXPECT_EQ(log.find("  Added rule: oddTypes\n"), log.rfind("  Added rule: oddTypes\n"));
   EXPECT_NE(log.find("  Added rule: oddTypes\n"), std::string::npos);
   EXPECT_THAT(log, HasSubstr("  Skipping disabled rule: disabled\n"));
   EXPECT_THAT(log, Not(HasSubstr("Added rule: stringTypes")));
-  EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("tree/notes.txt"))));
+  EXPECT_THAT(log, Not(HasSubstr("Added rule: old")));
+  EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("rules.d/notes.txt"))));
   EXPECT_THAT(log, HasSubstr("  Added rule: twice\n  Added rule: twice\n"));
   EXPECT_THAT(log, HasSubstr("  Added rule: two\n  Added rule: two\n"));
-  EXPECT_THAT(log, HasSubstr("LOADING RULES (" + dir.file("tree/.hidden/three.plist") + ")"));
-}
-
-TEST_F(DaemonTest, SingleRulesFileIsChosenByItsExtension) {
-  const std::string config = writeConfig();
-  Daemon daemon({"-c", config, "-r", writeOneRule(), "-v", "1"}, dir);
-  ASSERT_TRUE(daemon.waitForLine(errorLog, "Loaded 1 rules"));
-  EXPECT_EQ(daemon.stop(SIGTERM), 0);
-
-  // A directory is loaded as a directory even when its name has an extension; leftovers of
-  // editors and package managers beside the rules are not loaded.
-  dir.write("rules.d/a.plist", RulesDocument({RuleXml("r", {"x"})}));
-  dir.write("rules.d/a.plist.dpkg-old", RulesDocument({RuleXml("old", {"x"})}));
-  Daemon second({"-c", config, "-r", dir.file("rules.d"), "-v", "1"}, dir);
-  ASSERT_TRUE(second.waitForLine(errorLog, "1 rules loaded, 1 files skipped"));
-  EXPECT_EQ(second.stop(SIGTERM), 0);
+  EXPECT_THAT(log, HasSubstr("LOADING RULES (" + dir.file("rules.d/.hidden/three.plist") + ")"));
 }
 
 TEST_F(DaemonTest, SigusrOneIsIgnoredAndSigtermWithSighupStopsWithoutReloading) {
