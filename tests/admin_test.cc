@@ -25,11 +25,10 @@ TEST_F(AdminTest, CheckReportsBrokenFilesAndPassesTheExamples) {
       ConfigPlist({{"debugLevl", Int(1)},
                    {"periodicEvents",
                     Arr({Dict({{"eventType", Str("tick")}, {"startInterval", Int(0)}})})}}));
-  const std::string types = Arr({Str("auth.failure")});
-  dir.write("rules.d/ssh.plist", RulesDocument({RuleXml("count", {"auth.failure"}),
-                                                Dict({{"name", Str("ban")},
-                                                      {"eventTypes", types},
-                                                      {"critera", Arr({Criterion("true")})}})}));
+  dir.write(
+      "rules.d/ssh.plist",
+      RulesDocument({RuleXml("count", {"auth.failure"}),
+                     RuleXml("ban", {"auth.failure"}, {{"critera", Arr({Criterion("true")})}})}));
   dir.write("rules.d/root.plist", PlistDocument(Dict({{"name", Str("x")}})));
   dir.write("rules.d/broken.plist", "<plist><array><dict>");
   dir.write("rules.d/ssh.plist~", RulesDocument({RuleXml("old", {"auth.failure"})}));

@@ -9,10 +9,8 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -30,12 +28,6 @@ std::string ReadFile(const std::string& path) {
   std::ostringstream buffer;
   buffer << in.rdbuf();
   return buffer.str();
-}
-
-void WriteFile(const std::string& path, std::string_view content) {
-  fs::create_directories(fs::path(path).parent_path());
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out.write(content.data(), static_cast<std::streamsize>(content.size()));
 }
 
 bool FileExists(const std::string& path) {
@@ -57,7 +49,8 @@ TempDir::~TempDir() {
 
 std::string TempDir::write(std::string_view name, std::string_view content) const {
   const std::string path = file(name);
-  WriteFile(path, content);
+  fs::create_directories(fs::path(path).parent_path());
+  std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
   return path;
 }
 
@@ -72,14 +65,11 @@ std::string TarvodctlBinary() {
 }
 
 std::string PlistDocument(std::string_view bodyXml) {
-  std::string doc =
-      "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
-      "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
-      "\"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
-      "<plist version=\"1.0\">\n";
-  doc += bodyXml;
-  doc += "\n</plist>\n";
-  return doc;
+  return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
+         "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
+         "\"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
+         "<plist version=\"1.0\">\n" +
+         std::string(bodyXml) + "\n</plist>\n";
 }
 
 std::string ConfigPlist(const ConfigEntries& config, std::string_view initialGlobalsXml) {
@@ -87,12 +77,9 @@ std::string ConfigPlist(const ConfigEntries& config, std::string_view initialGlo
   for (const auto& [key, xml] : config) body += "<key>" + key + "</key>" + xml + "\n";
   body += "</dict>\n";
   if (!initialGlobalsXml.empty()) {
-    body += "<key>initialGlobals</key>\n";
-    body += initialGlobalsXml;
-    body += "\n";
+    body += "<key>initialGlobals</key>\n" + std::string(initialGlobalsXml) + "\n";
   }
-  body += "</dict>";
-  return PlistDocument(body);
+  return PlistDocument(body + "</dict>");
 }
 
 namespace {

@@ -19,7 +19,6 @@ namespace tarvod::testing {
 using namespace std::chrono_literals;
 
 std::string ReadFile(const std::string& path);
-void WriteFile(const std::string& path, std::string_view content);
 bool FileExists(const std::string& path);
 
 // A fresh directory under /tmp, removed with everything in it at the end of the test.
@@ -34,7 +33,6 @@ class TempDir {
   std::string file(std::string_view name) const { return mPath + "/" + std::string(name); }
   // Writes a file (creating parent directories) and returns its full path.
   std::string write(std::string_view name, std::string_view content) const;
-  std::string read(std::string_view name) const { return ReadFile(file(name)); }
 
  private:
   std::string mPath;
