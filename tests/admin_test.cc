@@ -108,9 +108,7 @@ TEST_F(AdminTest, TestShowsWhatARuleWouldDoAndDoesNothing) {
 }
 
 // Each example rule set, run from the saved counts its comment speaks of, does what the
-// comment promises: the fifth SSH failure of an address bans it (IPv4 or IPv6 set) and starts
-// its count again, the hourly event lifts every ban, the third sudo failure mails the
-// administrator, a file system crossing 90% is paged once, a failed job goes to the bus.
+// comment promises.
 TEST_F(AdminTest, ExampleRuleSetsDoWhatTheirCommentsSay) {
   const std::string sets = std::string(TARVOD_SOURCE_DIR) + "/examples/rulesets/";
   const std::string config = dir.write(

@@ -1,8 +1,5 @@
-// Rules run end to end in the real daemon: prefix order, records, the event counter, the three
-// criterion modes, variables, action dispatch and keychain values. The daemon's own
-// "startup.load" event (and events sent through the event socket) drive the rules. Tests that
-// read runs of consecutive log lines use the "shutdown" event: while startup's rules run, the
-// main thread is still writing its own lines between theirs.
+// Rules run end to end in the real daemon. Tests that read runs of consecutive log lines use
+// the "shutdown" event: while startup's rules run, the main thread writes lines between theirs.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <signal.h>
@@ -93,9 +90,8 @@ TEST_F(DispatchTest, RunsTheLongerPrefixFirstAndRecordsEachMatchedPrefix) {
   EXPECT_EQ(shutdown[0].attribute("eventBlocked"), "false");
 }
 
-// Each type counts its events since the rules were loaded. With keepLogFilesOpen, a log file
-// renamed away (as logrotate does) is followed at the next event, and after a reload; so is
-// the records file, which is always kept open.
+// Each type counts its events since the rules were loaded; with keepLogFilesOpen, log files
+// and the records file follow a rename (as logrotate does) at the next event and at a reload.
 TEST_F(DispatchTest, CountsEachTypeSinceTheRulesWereLoadedAndKeptFilesFollowARotation) {
   const auto rotate = [](const std::string& path, const std::string& to) {
     ASSERT_EQ(std::rename(path.c_str(), to.c_str()), 0);
@@ -216,9 +212,7 @@ TEST_F(DispatchTest, DispatchesActionsByKeywordAndDumpsOnlyForExactData) {
   EXPECT_THAT(log, HasSubstr("  Executing action (null) (0)\n\n"));
 }
 
-// The administrator stores a password with tarvodctl; rules read it, and nothing the daemon
-// writes shows it: not the error log at level 6, the event log, the records, a log action's
-// file or a debugdump.
+// A password stored with tarvodctl reaches the rules; nothing the daemon writes shows it.
 TEST_F(DispatchTest, KeychainValuesReachRulesButNoLogShowsThem) {
   const std::string store = dir.file("etc/system.keychain");
   const std::string secret = "Hunter2-s3cr3t";

@@ -1,7 +1,5 @@
-// The structured log through a real systemd-journald: the test moves itself into a private
-// mount namespace with empty tmpfs mounts over the journal's socket and storage directories,
-// starts its own journald there, runs the daemon (which inherits the namespace) and reads the
-// records back with journalctl. Needs root; skipped otherwise.
+// The structured log through a real systemd-journald of the test's own, in a private mount
+// namespace the daemon inherits; records are read back with journalctl. Root only.
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -157,9 +155,8 @@ TEST_F(JournalTest, EventRecordsAndKvlogMessagesReachTheJournalWithTheirAttribut
   EXPECT_THAT(kv, HasSubstr("\tAMESSAGE=detail text\t"));  // never the record's own MESSAGE
 }
 
-// A journal that takes no more records: a socket at the journal's address that nobody
-// reads, so that sending a record blocks the rule job for good once its queue is full. The
-// daemon must still stop within shutdownTimeout, report what it dropped and save its state.
+// A journal socket nobody reads blocks the rule job for good: the daemon must still stop within
+// shutdownTimeout, report what it dropped and save its state.
 TEST_F(JournalTest, AStopEndsInTimeWhileARuleIsStuck) {
   unlink(kSocket);
   const int stuck = BindUnixDatagram(kSocket);
@@ -241,9 +238,8 @@ TEST_F(JournalTest, RootSshdLinesBecomeLoginEventsAndForgedOnesNothing) {
                                                  "auth.failure|192.0.2.11|after|Journal\n"));
 }
 
-// Without a journal each record costs one message, said once before the first failure that
-// records have nowhere to go; a flood leaves a few lines whose counts add up, and the rules
-// still run.
+// Without a journal each record costs one message, announced once before the first; a flood
+// leaves a few lines whose counts add up.
 TEST_F(JournalTest, AFloodOfUndeliverableRecordsLeavesAFewLinesWhoseCountsAddUp) {
   constexpr int kEvents = 100'000;
   ASSERT_NE(access(kSocket, F_OK), 0);

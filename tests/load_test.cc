@@ -19,9 +19,8 @@ namespace {
 
 constexpr int kSenders = 8;
 constexpr int kEventsPerSender = 25'000;
-// The daemon's peak resident memory must stay below this. An unbounded queue of 200,000
-// parsed events and their rule jobs would take several hundred MiB; the bounded pipeline
-// needs a small fraction of it (about 8 MiB here).
+// An unbounded queue of 200,000 parsed events would take several hundred MiB; the bounded
+// pipeline needs about 8 MiB.
 constexpr long kResidentBoundKb = 32 * 1024;
 // Sanitizer runtimes keep freed memory in quarantine and shadow every byte, so only the
 // plain build measures the daemon's own memory.
@@ -38,10 +37,8 @@ std::string EventPlist(const char* type, const char* key, const std::string& val
 
 class LoadTest : public TarvodTest {};
 
-// SIGHUP twenty times while eight senders flood: no event is lost or counted twice, each
-// reload is one reload, the rules read by the last one are the ones that run, and memory stays
-// bounded while the rule engine lags behind the senders (the event socket then stops reading
-// and senders wait in the kernel).
+// Twenty reloads while eight senders flood: no event lost or counted twice, the last rules
+// run, and memory bounded while the engine lags (senders then wait in the kernel).
 TEST_F(LoadTest, ReloadsUnderLoadLoseNoEventAndSwapInTheNewRules) {
   constexpr int kReloads = 20;
   const auto writeRules = [&](int generation) {
@@ -95,10 +92,8 @@ TEST_F(LoadTest, ReloadsUnderLoadLoseNoEventAndSwapInTheNewRules) {
   EXPECT_EQ(daemon.stop(), 0);
 }
 
-// A rule whose first log action cannot open its file ("missing/" does not exist), so that each
-// event logs "LOG: Cannot open ..."; events alternate between two such files. The second
-// action counts the events that ran. With a repeat interval the counts of the last window are
-// written when it ends, while the daemon runs; with none, every line is written.
+// Each event's first log action fails ("missing/" does not exist) on one of two files; the
+// second counts the events. A window's counts are written when it ends, while the daemon runs.
 TEST_F(LoadTest, AFloodOfOneFailureLeavesAFewLinesWhoseCountsAddUp) {
   const struct {
     int repeatInterval;

@@ -1,6 +1,5 @@
-// The mail actions in the real daemon: relay mode through femail to a real SMTP server
-// (python3-aiosmtpd, started on a free port), local mode through a recording mail program, and
-// one real bsd-mailx run handing the mail to a sendmail stand-in in a private mount namespace.
+// The mail actions in the real daemon: relay mode through femail to aiosmtpd, local mode through
+// a recording mail program, and bsd-mailx handing the mail to a sendmail stand-in.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <signal.h>

@@ -80,9 +80,8 @@ TEST_F(NotificationsTest, ObservedObjectsDeliverTheirUserInformationAsTheEvent) 
   EXPECT_EQ(daemon.stop(), 0);
 }
 
-// The rule job stuck on a full FIFO holds the reload inside its rule loading, after the old
-// observations are gone and before the new ones exist: a notification posted then must
-// still arrive once the reload is over.
+// A rule job stuck on a full FIFO holds the reload between the old observations and the new:
+// a notification posted then must still arrive after it.
 TEST_F(NotificationsTest, ANotificationPostedDuringAReloadIsDeliveredAfterIt) {
   const std::string fifo = dir.file("fifo");
   ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);

@@ -1,7 +1,5 @@
-// The run-command action in the real daemon, run as root against real users and groups made
-// for the test: identities and descriptors as the program sees them in /proc, environment,
-// redirections, the failures before and after the start, time limits, and the
-// daemon's own descriptors and children after many commands.
+// The run-command action in the real daemon, as root, against users and groups made for the
+// test: what the program sees in /proc, failures, time limits, and what many commands leave.
 #include <gmock/gmock.h>
 #include <grp.h>
 #include <gtest/gtest.h>
