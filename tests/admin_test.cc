@@ -17,23 +17,18 @@ namespace {
 using ::testing::HasSubstr;
 using ::testing::Not;
 
-RunResult Tarvodctl(std::vector<std::string> args) {
-  args.insert(args.begin(), TarvodctlBinary());
-  return RunProgram(args);
-}
+class AdminTest : public TarvodTest {};
 
-TEST(AdminTest, CheckReportsBrokenFilesAndPassesTheExamples) {
-  TempDir dir;
+TEST_F(AdminTest, CheckReportsBrokenFilesAndPassesTheExamples) {
   const std::string config = dir.write(
       "tarvod.plist",
       ConfigPlist({{"debugLevl", Int(1)},
                    {"periodicEvents",
                     Arr({Dict({{"eventType", Str("tick")}, {"startInterval", Int(0)}})})}}));
-  const std::string types = Arr({Str("auth.failure")});
-  dir.write("rules.d/ssh.plist", RulesDocument({RuleXml("count", {"auth.failure"}),
-                                                Dict({{"name", Str("ban")},
-                                                      {"eventTypes", types},
-                                                      {"critera", Arr({Criterion("true")})}})}));
+  dir.write(
+      "rules.d/ssh.plist",
+      RulesDocument({RuleXml("count", {"auth.failure"}),
+                     RuleXml("ban", {"auth.failure"}, {{"critera", Arr({Criterion("true")})}})}));
   dir.write("rules.d/root.plist", PlistDocument(Dict({{"name", Str("x")}})));
   dir.write("rules.d/broken.plist", "<plist><array><dict>");
   dir.write("rules.d/ssh.plist~", RulesDocument({RuleXml("old", {"auth.failure"})}));
@@ -62,17 +57,16 @@ TEST(AdminTest, CheckReportsBrokenFilesAndPassesTheExamples) {
   EXPECT_EQ(Tarvodctl({"check", "-c", dir.file("none"), "-r", clean}).status, 0);
   EXPECT_EQ(Tarvodctl({"check", "--strict", "-c", dir.file("none"), "-r", clean}).status, 1);
 
-  for (const char* rulesPath : {"examples/rules", "examples/rulesets"}) {
+  for (const char* examples : {"examples/rules", "examples/rulesets"}) {
     const RunResult example = Tarvodctl({"check", "--strict", "-c",
                                          std::string(TARVOD_SOURCE_DIR) + "/examples/tarvod.plist",
-                                         "-r", std::string(TARVOD_SOURCE_DIR) + "/" + rulesPath});
+                                         "-r", std::string(TARVOD_SOURCE_DIR) + "/" + examples});
     EXPECT_EQ(example.status, 0) << example.out;
     EXPECT_THAT(example.out, HasSubstr(" 0 errors, 0 warnings\n"));
   }
 }
 
-TEST(AdminTest, TestShowsWhatARuleWouldDoAndDoesNothing) {
-  TempDir dir;
+TEST_F(AdminTest, TestShowsWhatARuleWouldDoAndDoesNothing) {
   const std::string written = dir.file("written.log");
   const std::string touched = dir.file("touched");
   const std::string rules = dir.write(
@@ -114,11 +108,8 @@ TEST(AdminTest, TestShowsWhatARuleWouldDoAndDoesNothing) {
 }
 
 // Each example rule set, run from the saved counts its comment speaks of, does what the
-// comment promises: the fifth SSH failure of an address bans it (IPv4 or IPv6 set) and starts
-// its count again, the hourly event lifts every ban, the third sudo failure mails the
-// administrator, a file system crossing 90% is paged once, a failed job goes to the bus.
-TEST(AdminTest, ExampleRuleSetsDoWhatTheirCommentsSay) {
-  TempDir dir;
+// comment promises.
+TEST_F(AdminTest, ExampleRuleSetsDoWhatTheirCommentsSay) {
   const std::string sets = std::string(TARVOD_SOURCE_DIR) + "/examples/rulesets/";
   const std::string config = dir.write(
       "tarvod.plist", ConfigPlist({{"saveState", "<true/>"}, {"stateDirectory", Str(dir.path())}},
@@ -184,28 +175,13 @@ TEST(AdminTest, ExampleRuleSetsDoWhatTheirCommentsSay) {
   }
 }
 
-}  // namespace
-}  // namespace tarvod::testing
-
-namespace tarvod::testing {
-namespace {
-
-TEST(AdminTest, StatsCountWhatWasSentAndAnswerRootOnly) {
-  TempDir dir;
-  const std::string errorLog = dir.file("error.log");
-  const std::string socket = dir.file("evtq");
-  const std::string config =
-      dir.write("tarvod.plist", ConfigPlist({{"errorLogPath", Str(errorLog)},
-                                             {"structuredLogPath", Str(dir.file("records.jsonl"))},
-                                             {"eventSocketPath", Str(socket)},
-                                             {"stateDirectory", Str(dir.path())}}));
-  const std::string rules = dir.write(
-      "rules.plist", RulesDocument({RuleXml(
-                         "odd", {"auth.failure"},
-                         {{"criterion", Arr({Criterion("equal", {Str("${event:n}"), Str("1")})})},
-                          {"actions", Arr({FileLog("x", dir.file("missing/x.log"))})}})}));
-  Daemon daemon({"-c", config, "-r", rules, "-n", "-v", "1"}, dir);
-  ASSERT_TRUE(daemon.waitForStartup(errorLog)) << daemon.stderrText();
+TEST_F(AdminTest, StatsCountWhatWasSentAndAnswerRootOnly) {
+  Daemon& daemon =
+      start({RuleXml("odd", {"auth.failure"},
+                     {{"criterion", Arr({Criterion("equal", {Str("${event:n}"), Str("1")})})},
+                      {"actions", Arr({FileLog("x", dir.file("missing/x.log"))})}})},
+            1);
+  const std::string config = dir.file("tarvod.plist");
   for (const char* n : {"1", "2", "1"}) {
     ASSERT_EQ(Tarvodctl({"-c", config, "send", "auth.failure.ssh", std::string("n=") + n}).status,
               0);
@@ -222,13 +198,13 @@ TEST(AdminTest, StatsCountWhatWasSentAndAnswerRootOnly) {
   EXPECT_THAT(stats.out, HasSubstr("\"auth.failure\": 3"));
   EXPECT_THAT(stats.out, HasSubstr("\"eventsPerSource\": {\"socket\": 3, \"sshLogins\": 0, "
                                    "\"notifications\": 0, \"periodic\": 0, \"daemon\": 1}"));
-  EXPECT_THAT(stats.out, HasSubstr("{\"name\": \"odd\", \"file\": \"" + rules +
+  EXPECT_THAT(stats.out, HasSubstr("{\"name\": \"odd\", \"file\": \"" + rulesPath +
                                    "\", \"runs\": 3, \"fired\": 2,"));
   EXPECT_THAT(stats.out, HasSubstr("\"log\": {\"run\": 2, \"failed\": 2}"));
   EXPECT_THAT(Tarvodctl({"-c", config, "status"}).out, HasSubstr(" 1 rules loaded, "));
 
   // A second daemon on the same socket says so on standard error.
-  Daemon second({"-c", config, "-r", rules, "-n"}, dir);
+  Daemon second({"-c", config, "-r", rulesPath, "-n"}, dir);
   const std::string held =
       "tarvod: the event socket cannot be opened: another process listens on " + socket;
   for (int i = 0; i < 100 && second.stderrText().find(held) == std::string::npos; ++i) {

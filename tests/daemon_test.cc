@@ -6,7 +6,6 @@
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -20,34 +19,20 @@ namespace {
 using ::testing::HasSubstr;
 using ::testing::Not;
 
-std::string RuleXml(std::string_view name, std::string_view eventTypesXml,
-                    std::string_view extra = {}) {
-  return "<dict><key>name</key><string>" + std::string(name) + "</string><key>eventTypes</key>" +
-         std::string(eventTypesXml) + std::string(extra) + "</dict>";
-}
-
-class DaemonTest : public ::testing::Test {
+class DaemonTest : public TarvodTest {
  protected:
-  std::string errorLog() const { return dir.file("error.log"); }
-  std::string writeConfig(std::vector<std::pair<std::string, std::string>> extra = {}) const {
-    extra.insert(extra.begin(), {"errorLogPath", Str(errorLog())});
-    return dir.write("tarvod.plist", ConfigPlist(extra));
-  }
   std::string writeOneRule() const {
-    return dir.write("rules/a.plist",
-                     RulesDocument({RuleXml("first", "<array><string>x.y</string></array>")}));
+    return dir.write("rules/a.plist", RulesDocument({RuleXml("first", {"x.y"})}));
   }
-  RunResult run(const std::vector<std::string>& args) const {
+  RunResult tarvod(const std::vector<std::string>& args) const {
     std::vector<std::string> argv{TarvodBinary()};
     argv.insert(argv.end(), args.begin(), args.end());
     return RunProgram(argv);
   }
-
-  TempDir dir;
 };
 
 TEST_F(DaemonTest, UsageErrorPrintsOnlyTheUsageLineAndExits255) {
-  const RunResult result = run({"-x"});
+  const RunResult result = tarvod({"-x"});
   EXPECT_EQ(result.status, 255);
   EXPECT_EQ(result.err, "Usage: " + TarvodBinary() +
                             " [ -r <rules.plist>] [-c <config file> ] [-v <debug level>] [-n]\n");
@@ -58,33 +43,32 @@ TEST_F(DaemonTest, QuitsWithStatusZeroWhenNoRulesAreFound) {
   const std::string config = writeConfig();
   mkdir(dir.file("empty").c_str(), 0755);
   for (const std::string& rules : {dir.file("empty"), dir.file("missing")}) {
-    const RunResult result = run({"-c", config, "-r", rules});
+    const RunResult result = tarvod({"-c", config, "-r", rules});
     EXPECT_EQ(result.status, 0) << result.err;
-    const std::string log = ReadFile(errorLog());
+    const std::string log = ReadFile(errorLog);
     EXPECT_THAT(log, HasSubstr("No rules found in " + rules + ", quitting....\n"));
     EXPECT_THAT(log, HasSubstr("Velkin Shutdown at "));
   }
+  struct stat st {};
+  ASSERT_EQ(stat(errorLog.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
 }
 
 TEST_F(DaemonTest, DebugLevelComesFromTheCommandLineUnlessItIsZero) {
   const std::string rules = dir.file("empty");
   mkdir(rules.c_str(), 0755);
-  struct Case {
+  const struct {
     std::string option;
-    std::string configured;
+    long configured;
     bool expectLevel1;
     bool expectLevel4;
-  };
-  for (const Case& c :
-       {Case{"0", "1", true, false}, Case{"4", "1", true, true}, Case{"-1", "6", false, false}}) {
-    std::remove(errorLog().c_str());
-    std::vector<std::pair<std::string, std::string>> extra;
-    if (!c.configured.empty())
-      extra.emplace_back("debugLevel", "<integer>" + c.configured + "</integer>");
-    const std::string config = writeConfig(extra);
-    ASSERT_EQ(run({"-c", config, "-r", rules, "-v", c.option}).status, 0);
-    const std::string log = ReadFile(errorLog());
-    SCOPED_TRACE("-v '" + c.option + "' debugLevel '" + c.configured + "'");
+  } cases[] = {{"0", 1, true, false}, {"4", 1, true, true}, {"-1", 6, false, false}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE("-v " + c.option);
+    std::remove(errorLog.c_str());
+    const std::string config = writeConfig({{"debugLevel", Int(c.configured)}});
+    ASSERT_EQ(tarvod({"-c", config, "-r", rules, "-v", c.option}).status, 0);
+    const std::string log = ReadFile(errorLog);
     EXPECT_EQ(log.find("Loaded 0 rules") != std::string::npos, c.expectLevel1);
     EXPECT_EQ(log.find("Velkin rules path is") != std::string::npos, c.expectLevel4);
     // Level-0 messages are written unless the level is negative.
@@ -92,127 +76,79 @@ TEST_F(DaemonTest, DebugLevelComesFromTheCommandLineUnlessItIsZero) {
   }
 }
 
-TEST_F(DaemonTest, ErrorLogIsCreatedPrivateAndAppendedTo) {
-  const std::string config = writeConfig();
-  const std::string rules = dir.file("missing");
-  ASSERT_EQ(run({"-c", config, "-r", rules}).status, 0);
-  struct stat st {};
-  ASSERT_EQ(stat(errorLog().c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
-  const std::string first = ReadFile(errorLog());
-  ASSERT_EQ(run({"-c", config, "-r", rules}).status, 0);
-  const std::string both = ReadFile(errorLog());
-  EXPECT_EQ(both.substr(0, first.size()), first);
-  EXPECT_GT(both.size(), first.size());
-  // Each message is its text and exactly one newline; "Loaded %d rules\n" leaves an empty line.
-  EXPECT_THAT(both, Not(HasSubstr("\n\n\n")));
-}
-
-TEST_F(DaemonTest, SymbolicLinkAtTheErrorLogPathIsRefusedAndHardLinkAccepted) {
+TEST_F(DaemonTest, SymbolicLinkAtTheErrorLogPathIsRefusedAndAHardLinkAppendedTo) {
   const std::string target = dir.write("target.log", "existing\n");
   const std::string config = writeConfig();
-  ASSERT_EQ(symlink(target.c_str(), errorLog().c_str()), 0);
-  RunResult result = run({"-c", config, "-r", dir.file("missing")});
+  ASSERT_EQ(symlink(target.c_str(), errorLog.c_str()), 0);
+  RunResult result = tarvod({"-c", config, "-r", dir.file("missing")});
   EXPECT_EQ(result.status, 255);
-  EXPECT_THAT(result.err, HasSubstr("failed to open " + errorLog() + " errno = 13"));
+  EXPECT_THAT(result.err, HasSubstr("failed to open " + errorLog + " errno = 13"));
   EXPECT_EQ(ReadFile(target), "existing\n");
 
-  unlink(errorLog().c_str());
-  ASSERT_EQ(link(target.c_str(), errorLog().c_str()), 0);
-  result = run({"-c", config, "-r", dir.file("missing")});
+  unlink(errorLog.c_str());
+  ASSERT_EQ(link(target.c_str(), errorLog.c_str()), 0);
+  result = tarvod({"-c", config, "-r", dir.file("missing")});
   EXPECT_EQ(result.status, 0);
-  EXPECT_THAT(ReadFile(target), HasSubstr("No rules found"));
   EXPECT_EQ(ReadFile(target).rfind("existing\n", 0), 0u);
+  EXPECT_THAT(ReadFile(target), HasSubstr("No rules found"));
 }
 
+// The rules directory is loaded as a directory though its name has an extension; leftovers of
+// editors and package managers beside the rules are not loaded.
 TEST_F(DaemonTest, RulesTreeLoadsEveryRulesFileAtAnyDepth) {
-  const std::string types = "<array><string>a.b</string></array>";
-  dir.write("tree/one.plist", RulesDocument({RuleXml("one", types)}));
-  dir.write(
-      "tree/nested/deeper/two.plist",
-      RulesDocument({RuleXml("two", "<array><string>a.b</string><string>c</string></array>")}));
-  dir.write("tree/.hidden/three.plist", RulesDocument({RuleXml("three", types)}));
-  dir.write("tree/.four.plist", RulesDocument({RuleXml("four", types)}));
-  dir.write("tree/notes.txt", "not a property list");
-  dir.write("tree/dict.plist", PlistDocument("<dict><key>name</key><string>x</string></dict>"));
-  dir.write("tree/mixed.plist",
-            RulesDocument({RuleXml("disabled", types, "<key>enabled</key><false/>"),
-                           RuleXml("stringTypes", "<string>a.b</string>"), "<string>junk</string>",
-                           RuleXml("twice", "<array><string>d</string><string>d</string></array>"),
-                           RuleXml("none", "<array/>"),
-                           RuleXml("oddTypes",
-                                   "<array><integer>5</integer><true/><array><string>e</string>"
-                                   "</array><string>e</string></array>")}));
-  const std::string config = writeConfig({{"debugLevel", "<integer>3</integer>"}});
-  Daemon daemon({"-c", config, "-r", dir.file("tree")}, dir);
-  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+  dir.write("rules.d/one.plist", RulesDocument({RuleXml("one", {"a.b"})}));
+  dir.write("rules.d/nested/deeper/two.plist", RulesDocument({RuleXml("two", {"a.b", "c"})}));
+  dir.write("rules.d/.hidden/three.plist", RulesDocument({RuleXml("three", {"a.b"})}));
+  dir.write("rules.d/.four.plist", RulesDocument({RuleXml("four", {"a.b"})}));
+  dir.write("rules.d/notes.txt", "not a property list");
+  dir.write("rules.d/one.plist.dpkg-old", RulesDocument({RuleXml("old", {"a.b"})}));
+  dir.write("rules.d/dict.plist", PlistDocument(Dict({{"name", Str("x")}})));
+  dir.write("rules.d/mixed.plist",
+            RulesDocument(
+                {RuleXml("disabled", {"a.b"}, {{"enabled", Bool(false)}}),
+                 Dict({{"name", Str("stringTypes")}, {"eventTypes", Str("a.b")}}), Str("junk"),
+                 RuleXml("twice", {"d", "d"}), RuleXml("none", {}),
+                 Dict({{"name", Str("oddTypes")},
+                       {"eventTypes", Arr({Int(5), Bool(true), Arr({Str("e")}), Str("e")})}})}));
+  Daemon daemon({"-c", writeConfig({{"debugLevel", Int(3)}}), "-r", dir.file("rules.d")}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog, "Registered"));
   EXPECT_EQ(daemon.stop(SIGINT), 0);
-  const std::string log = ReadFile(errorLog());
+  const std::string log = ReadFile(errorLog);
   // one, two, three, four, twice, none and oddTypes; the disabled rule and the string-typed
   // one are not.
   EXPECT_THAT(log, HasSubstr("Loaded 7 rules\n"));
   // Only the string among oddTypes' types indexes it; each other entry is named and skipped.
-  const std::string mixed = dir.file("tree/mixed.plist");
+  const std::string mixed = dir.file("rules.d/mixed.plist");
   EXPECT_THAT(log, HasSubstr(mixed + ": rule 6 \"oddTypes\": eventTypes[1]: must be a string, "
                                      "not an integer\n"));
   EXPECT_THAT(log, HasSubstr(mixed + ": rule 3: must be a dictionary, not a string; skipped\n"));
-  EXPECT_THAT(log, HasSubstr(dir.file("tree/dict.plist") +
+  EXPECT_THAT(log, HasSubstr(dir.file("rules.d/dict.plist") +
                              ": the top level is not an array of rules; skipped\n"));
-  EXPECT_THAT(log, HasSubstr("5 files read, 7 rules loaded, 2 files skipped, 8 problems found\n"));
+  EXPECT_THAT(log, HasSubstr("5 files read, 7 rules loaded, 3 files skipped, 9 problems found\n"));
   EXPECT_EQ(log.find("  Added rule: oddTypes\n"), log.rfind("  Added rule: oddTypes\n"));
   EXPECT_NE(log.find("  Added rule: oddTypes\n"), std::string::npos);
   EXPECT_THAT(log, HasSubstr("  Skipping disabled rule: disabled\n"));
   EXPECT_THAT(log, Not(HasSubstr("Added rule: stringTypes")));
-  EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("tree/notes.txt"))));
-  EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("tree/dict.plist"))));
+  EXPECT_THAT(log, Not(HasSubstr("Added rule: old")));
+  EXPECT_THAT(log, Not(HasSubstr("LOADING RULES (" + dir.file("rules.d/notes.txt"))));
   EXPECT_THAT(log, HasSubstr("  Added rule: twice\n  Added rule: twice\n"));
   EXPECT_THAT(log, HasSubstr("  Added rule: two\n  Added rule: two\n"));
-  EXPECT_THAT(log, HasSubstr("LOADING RULES (" + dir.file("tree/.hidden/three.plist") + ")"));
-  EXPECT_THAT(log, HasSubstr("Velkin Shutdown at"));
+  EXPECT_THAT(log, HasSubstr("LOADING RULES (" + dir.file("rules.d/.hidden/three.plist") + ")"));
 }
 
-TEST_F(DaemonTest, SingleRulesFileIsChosenByItsExtension) {
-  const std::string config = writeConfig();
-  const std::string rules = writeOneRule();
-  Daemon daemon({"-c", config, "-r", rules, "-v", "1"}, dir);
-  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Loaded 1 rules"));
-  EXPECT_EQ(daemon.stop(SIGTERM), 0);
-  const std::string log = ReadFile(errorLog());
-  EXPECT_EQ(log.substr(log.rfind('\n', log.size() - 2) + 1).rfind("Velkin Shutdown at ", 0), 0u);
-
-  // A directory is loaded as a directory even when its name has an extension; leftovers of
-  // editors and package managers beside the rules are not loaded.
-  mkdir(dir.file("rules.d").c_str(), 0755);
-  dir.write("rules.d/a.plist", RulesDocument({RuleXml("r", "<array><string>x</string></array>")}));
-  dir.write("rules.d/a.plist.dpkg-old",
-            RulesDocument({RuleXml("old", "<array><string>x</string></array>")}));
-  Daemon second({"-c", config, "-r", dir.file("rules.d"), "-v", "1"}, dir);
-  ASSERT_TRUE(second.waitForLine(errorLog(), "1 rules loaded, 1 files skipped"));
-  EXPECT_EQ(second.stop(SIGTERM), 0);
-}
-
-TEST_F(DaemonTest, SigusrOneIsIgnored) {
-  const std::string config = writeConfig();
-  const std::string rules = writeOneRule();
-  Daemon daemon({"-c", config, "-r", rules, "-v", "1"}, dir);
-  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+TEST_F(DaemonTest, SigusrOneIsIgnoredAndSigtermWithSighupStopsWithoutReloading) {
+  Daemon daemon({"-c", writeConfig(), "-r", writeOneRule(), "-v", "1"}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog, "Registered"));
   kill(daemon.pid(), SIGUSR1);
   usleep(200 * 1000);
   EXPECT_TRUE(daemon.running());
-  EXPECT_EQ(daemon.stop(SIGTERM), 0);
-}
-
-TEST_F(DaemonTest, SigtermAndSighupTogetherStopWithoutReloading) {
-  const std::string config = writeConfig();
-  Daemon daemon({"-c", config, "-r", writeOneRule(), "-v", "1"}, dir);
-  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
   // Stopped, the daemon takes both signals at once when it continues.
   kill(daemon.pid(), SIGSTOP);
   kill(daemon.pid(), SIGHUP);
   kill(daemon.pid(), SIGTERM);
   kill(daemon.pid(), SIGCONT);
   EXPECT_EQ(daemon.wait(), 0);
-  EXPECT_THAT(ReadFile(errorLog()), Not(HasSubstr("Reloading Rules")));
+  EXPECT_THAT(ReadFile(errorLog), Not(HasSubstr("Reloading Rules")));
 }
 
 // logrotate moves the logs away and reloads: the error and event logs are written again by
@@ -221,79 +157,68 @@ TEST_F(DaemonTest, AReloadReopensRotatedLogs) {
   const std::string events = dir.file("events.log");
   const std::string config = writeConfig({{"logEvents", Int(1)}, {"eventLogPath", Str(events)}});
   Daemon daemon({"-c", config, "-r", writeOneRule(), "-v", "1"}, dir);
-  ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+  ASSERT_TRUE(daemon.waitForLine(errorLog, "Registered"));
   ASSERT_TRUE(daemon.waitForLine(events, "startup.load"));
-  ASSERT_EQ(std::rename(errorLog().c_str(), (errorLog() + ".1").c_str()), 0);
+  ASSERT_EQ(std::rename(errorLog.c_str(), (errorLog + ".1").c_str()), 0);
   ASSERT_EQ(std::rename(events.c_str(), (events + ".1").c_str()), 0);
   kill(daemon.pid(), SIGHUP);
-  EXPECT_TRUE(daemon.waitForLine(errorLog(), "Reloading Rules"));
+  EXPECT_TRUE(daemon.waitForLine(errorLog, "Reloading Rules"));
   EXPECT_TRUE(daemon.waitForLine(events, "startup.reload"));
   EXPECT_EQ(daemon.stop(), 0);
-  EXPECT_THAT(ReadFile(errorLog() + ".1"), Not(HasSubstr("Reloading Rules")));
+  EXPECT_THAT(ReadFile(errorLog + ".1"), Not(HasSubstr("Reloading Rules")));
   EXPECT_THAT(ReadFile(events + ".1"), Not(HasSubstr("startup.reload")));
-  EXPECT_THAT(ReadFile(errorLog()), HasSubstr("Velkin Shutdown at"));
+  EXPECT_THAT(ReadFile(errorLog), HasSubstr("Velkin Shutdown at"));
 }
 
-// Interval timers on the real loop: a one-second timer fires every second, an entry whose
-// interval is 0 is refused, and after a reload there is still one timer per entry (two
-// would tick twice as fast).
+// Interval timers on the real loop: a one-second timer fires every second, and after a reload
+// there is still one timer (two would tick twice as fast).
 TEST_F(DaemonTest, PeriodicEventsTickOnTheirIntervalAndAReloadRecreatesThem) {
   const std::string ticks = dir.file("ticks");
   const std::string config = writeConfig(
-      {{"periodicEvents", Arr({Dict({{"eventType", Str("tick")}, {"startInterval", Int(1)}}),
-                               Dict({{"eventType", Str("zero")}, {"startInterval", Int(0)}}),
-                               Dict({{"startInterval", Int(1)}})})}});
+      {{"periodicEvents", Arr({Dict({{"eventType", Str("tick")}, {"startInterval", Int(1)}})})}});
   const std::string rules = dir.write(
-      "rules.plist", RulesDocument({testing::RuleXml("tick", std::vector<std::string>{"tick"},
-                                                     {{"actions", Arr({FileLog("t", ticks)})}})}));
+      "rules.plist",
+      RulesDocument({RuleXml("tick", {"tick"}, {{"actions", Arr({FileLog("t", ticks)})}})}));
   Daemon daemon({"-c", config, "-r", rules, "-v", "3"}, dir);
   ASSERT_TRUE(daemon.waitForLine(ticks, "t\nt\n", 5s));
   kill(daemon.pid(), SIGHUP);
-  ASSERT_TRUE(daemon.waitForLine(errorLog(), "EVENT RECEIVED: startup.reload"));
+  ASSERT_TRUE(daemon.waitForLine(errorLog, "EVENT RECEIVED: startup.reload"));
   const auto reloaded = std::chrono::steady_clock::now();
   const std::string after = ReadFile(ticks) + "t\nt\nt\n";
   ASSERT_TRUE(daemon.waitForLine(ticks, after, 10s));
   EXPECT_GE(std::chrono::steady_clock::now() - reloaded, 2400ms);
   EXPECT_EQ(daemon.stop(), 0);
-  const std::string log = ReadFile(errorLog());
-  EXPECT_THAT(log, HasSubstr("entry 2 (zero) has startInterval 0, not a positive number"));
-  EXPECT_THAT(log, HasSubstr("2 Periodic Events configured"));
-  EXPECT_THAT(log, HasSubstr("Periodic Event received: {"));
+  EXPECT_THAT(ReadFile(errorLog), HasSubstr("Periodic Event received: {"));
 }
 
 // File-local variables survive a restart; the shutdown rules run before the state is saved
 // and "Velkin Shutdown at" is the last line.
 TEST_F(DaemonTest, StateIsSavedAtShutdownAndRestoredAtTheNextStart) {
   const std::string config =
-      writeConfig({{"saveState", "<true/>"}, {"stateDirectory", Str(dir.file("state"))}});
-  const std::string rules =
-      dir.write("rules.plist",
-                RulesDocument({testing::RuleXml("count", std::vector<std::string>{"startup.load"},
-                                                {{"variables", Dict({{"n", Str("${n} + 1")}})}}),
-                               testing::RuleXml("bye", std::vector<std::string>{"shutdown"},
-                                                {{"variables", Dict({{"bye", Str("yes")}})}})}));
+      writeConfig({{"saveState", Bool(true)}, {"stateDirectory", Str(dir.file("state"))}});
+  const std::string rules = dir.write(
+      "rules.plist",
+      RulesDocument(
+          {RuleXml("count", {"startup.load"}, {{"variables", Dict({{"n", Str("${n} + 1")}})}}),
+           RuleXml("bye", {"shutdown"}, {{"variables", Dict({{"bye", Str("yes")}})}})}));
   for (int run = 1; run <= 2; ++run) {
-    std::remove(errorLog().c_str());
+    std::remove(errorLog.c_str());
     Daemon daemon({"-c", config, "-r", rules, "-v", "1"}, dir);
-    ASSERT_TRUE(daemon.waitForLine(errorLog(), "Registered"));
+    ASSERT_TRUE(daemon.waitForLine(errorLog, "Registered"));
     EXPECT_EQ(daemon.stop(), 0);
     const std::string state = ReadFile(dir.file("state/state"));
     EXPECT_THAT(state, HasSubstr("<key>n</key>\n\t\t<integer>" + std::to_string(run)));
     EXPECT_THAT(state, HasSubstr("<key>bye</key>"));
   }
-  EXPECT_TRUE(FileExists(dir.file("state/state_prev")));
-  const std::string log = ReadFile(errorLog());
+  const std::string log = ReadFile(errorLog);
   EXPECT_LT(log.rfind("Saving the global state...\n"), log.rfind("Velkin Shutdown at "));
   EXPECT_EQ(log.find('\n', log.rfind("Velkin Shutdown at ")), log.size() - 1);
 }
 
 TEST_F(DaemonTest, TellsTheServiceManagerWhenReadyReloadingAndStopping) {
   const std::string socketPath = dir.file("notify");
-  const int listener = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", socketPath.c_str());
-  ASSERT_EQ(bind(listener, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  const int listener = BindUnixDatagram(socketPath);
+  ASSERT_GE(listener, 0);
   const auto next = [&] {
     pollfd ready{listener, POLLIN, 0};
     if (poll(&ready, 1, 10000) != 1) return std::string("(nothing)");
@@ -316,34 +241,31 @@ TEST_F(DaemonTest, TellsTheServiceManagerWhenReadyReloadingAndStopping) {
 
 // The fixed log directory is checked only inside a private mount namespace with a tmpfs over
 // /var/log, so the machine's own logs are never touched.
-class VelkinDirectoryTest : public DaemonTest {
- protected:
-  // Runs setup and then tarvod in the namespace; prints "status=N" and the probe's output.
-  RunResult runInNamespace(const std::string& setup, const std::string& probe) {
-    const std::string config = dir.write(
-        "velkin.plist", ConfigPlist({{"errorLogPath", Str("/var/log/velkin/tarvod.log")}}));
-    const std::string script = "mount -t tmpfs tmpfs /var/log || exit 99; umask 022; " + setup +
+TEST_F(DaemonTest, TheVelkinLogDirectoryIsCreatedAndNothingElseTakenForIt) {
+  const std::string config =
+      dir.write("velkin.plist", ConfigPlist({{"errorLogPath", Str("/var/log/velkin/tarvod.log")}}));
+  const struct {
+    std::string setup;
+    std::string out;  // what the shell prints: tarvod's status, then the directory's modes
+    std::string err;
+  } cases[] = {
+      {"true", "status=0\n755 directory\n600\n", ""},
+      {"touch /var/log/velkin", "status=255", "/var/log/velkin is not a directory"},
+      {"mkdir /var/log/real; ln -s /var/log/real /var/log/velkin", "status=255",
+       "/var/log/velkin is not a directory"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.setup);
+    const std::string script = "mount -t tmpfs tmpfs /var/log || exit 99; umask 022; " + c.setup +
                                "; '" + TarvodBinary() + "' -c '" + config + "' -r '" +
-                               dir.file("missing") + "'; echo status=$?; " + probe;
-    return RunProgram(
-        {"/usr/bin/unshare", "-m", "--propagation", "private", "/bin/sh", "-c", script});
-  }
-};
-
-TEST_F(VelkinDirectoryTest, MissingDirectoryIsCreated) {
-  const RunResult r = runInNamespace(
-      "true", "stat -c '%a %F' /var/log/velkin; stat -c '%a' /var/log/velkin/tarvod.log");
-  if (r.status == 99 || r.status == 127) GTEST_SKIP() << "no mount namespace here: " << r.err;
-  EXPECT_THAT(r.out, HasSubstr("status=0\n755 directory\n600\n"));
-}
-
-TEST_F(VelkinDirectoryTest, RegularFileOrLinkInItsPlaceFailsStartup) {
-  for (const std::string setup :
-       {"touch /var/log/velkin", "mkdir /var/log/real; ln -s /var/log/real /var/log/velkin"}) {
-    const RunResult r = runInNamespace(setup, "true");
+                               dir.file("missing") +
+                               "'; echo status=$?; stat -c '%a %F' /var/log/velkin; "
+                               "stat -c '%a' /var/log/velkin/tarvod.log";
+    const RunResult r =
+        RunProgram({"/usr/bin/unshare", "-m", "--propagation", "private", "/bin/sh", "-c", script});
     if (r.status == 99 || r.status == 127) GTEST_SKIP() << "no mount namespace here: " << r.err;
-    EXPECT_THAT(r.out, HasSubstr("status=255"));
-    EXPECT_THAT(r.err, HasSubstr("/var/log/velkin is not a directory"));
+    EXPECT_THAT(r.out, HasSubstr(c.out));
+    EXPECT_THAT(r.err, HasSubstr(c.err));
   }
 }
 

@@ -2,20 +2,22 @@
 
 #include <fcntl.h>
 #include <poll.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <cerrno>
+#include <cstdio>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <thread>
 
 #include "platform/seqpacket.h"
+#include "rules_xml.h"
 
 namespace tarvod::testing {
 
@@ -26,12 +28,6 @@ std::string ReadFile(const std::string& path) {
   std::ostringstream buffer;
   buffer << in.rdbuf();
   return buffer.str();
-}
-
-void WriteFile(const std::string& path, std::string_view content) {
-  fs::create_directories(fs::path(path).parent_path());
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out.write(content.data(), static_cast<std::streamsize>(content.size()));
 }
 
 bool FileExists(const std::string& path) {
@@ -53,7 +49,8 @@ TempDir::~TempDir() {
 
 std::string TempDir::write(std::string_view name, std::string_view content) const {
   const std::string path = file(name);
-  WriteFile(path, content);
+  fs::create_directories(fs::path(path).parent_path());
+  std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
   return path;
 }
 
@@ -68,28 +65,21 @@ std::string TarvodctlBinary() {
 }
 
 std::string PlistDocument(std::string_view bodyXml) {
-  std::string doc =
-      "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
-      "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
-      "\"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
-      "<plist version=\"1.0\">\n";
-  doc += bodyXml;
-  doc += "\n</plist>\n";
-  return doc;
+  return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
+         "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
+         "\"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
+         "<plist version=\"1.0\">\n" +
+         std::string(bodyXml) + "\n</plist>\n";
 }
 
-std::string ConfigPlist(const std::vector<std::pair<std::string, std::string>>& config,
-                        std::string_view initialGlobalsXml) {
+std::string ConfigPlist(const ConfigEntries& config, std::string_view initialGlobalsXml) {
   std::string body = "<dict>\n<key>config</key>\n<dict>\n";
   for (const auto& [key, xml] : config) body += "<key>" + key + "</key>" + xml + "\n";
   body += "</dict>\n";
   if (!initialGlobalsXml.empty()) {
-    body += "<key>initialGlobals</key>\n";
-    body += initialGlobalsXml;
-    body += "\n";
+    body += "<key>initialGlobals</key>\n" + std::string(initialGlobalsXml) + "\n";
   }
-  body += "</dict>";
-  return PlistDocument(body);
+  return PlistDocument(body + "</dict>");
 }
 
 namespace {
@@ -99,23 +89,6 @@ std::vector<char*> Argv(const std::vector<std::string>& args) {
   for (const auto& a : args) argv.push_back(const_cast<char*>(a.c_str()));
   argv.push_back(nullptr);
   return argv;
-}
-
-// Waits for pid with a deadline; returns the decoded status, or -1 on timeout.
-int WaitWithTimeout(pid_t pid, std::chrono::milliseconds timeout) {
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  for (;;) {
-    int status = 0;
-    const pid_t r = waitpid(pid, &status, WNOHANG);
-    if (r == pid) {
-      if (WIFEXITED(status)) return WEXITSTATUS(status);
-      if (WIFSIGNALED(status)) return 128 + WTERMSIG(status);
-      return -1;
-    }
-    if (r < 0 && errno != EINTR) return -1;
-    if (std::chrono::steady_clock::now() > deadline) return -1;
-    std::this_thread::sleep_for(5ms);
-  }
 }
 
 void DrainInto(int fd, std::string& out) {
@@ -222,28 +195,30 @@ bool Daemon::running() {
   return true;
 }
 
-bool Daemon::waitForLine(const std::string& file, std::string_view text,
-                         std::chrono::milliseconds timeout) {
+bool Daemon::waitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout) {
   const auto deadline = std::chrono::steady_clock::now() + timeout;
   for (;;) {
-    if (ReadFile(file).find(text) != std::string::npos) return true;
-    if (!running()) return ReadFile(file).find(text) != std::string::npos;
+    if (done()) return true;
+    if (!running()) return done();
     if (std::chrono::steady_clock::now() > deadline) return false;
     std::this_thread::sleep_for(10ms);
   }
 }
 
+bool Daemon::waitForLine(const std::string& file, std::string_view text,
+                         std::chrono::milliseconds timeout) {
+  return waitUntil([&] { return ReadFile(file).find(text) != std::string::npos; }, timeout);
+}
+
 bool Daemon::waitForStartup(const std::string& errorLog, std::chrono::milliseconds timeout) {
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  for (;;) {
-    const std::string text = ReadFile(errorLog);
-    const size_t first = text.find("Registered ");
-    if (first != std::string::npos && text.find("Registered ", first + 1) != std::string::npos) {
-      return true;
-    }
-    if (!running() || std::chrono::steady_clock::now() > deadline) return false;
-    std::this_thread::sleep_for(10ms);
-  }
+  return waitUntil(
+      [&] {
+        const std::string text = ReadFile(errorLog);
+        const size_t first = text.find("Registered ");
+        return first != std::string::npos &&
+               text.find("Registered ", first + 1) != std::string::npos;
+      },
+      timeout);
 }
 
 int Daemon::stop(int signal, std::chrono::milliseconds timeout) {
@@ -252,10 +227,11 @@ int Daemon::stop(int signal, std::chrono::milliseconds timeout) {
 }
 
 int Daemon::wait(std::chrono::milliseconds timeout) {
-  if (mStatus >= 0) return mStatus;
-  const int status = WaitWithTimeout(mPid, timeout);
-  if (status >= 0) mStatus = status;
-  return status;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (running() && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(5ms);
+  }
+  return mStatus;
 }
 
 std::string Daemon::stderrText() const { return ReadFile(mStderrPath); }
@@ -270,6 +246,16 @@ long StatusField(pid_t pid, std::string_view field) {
   return -1;
 }
 }  // namespace
+
+int BindUnixDatagram(const std::string& path) {
+  const int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+  if (bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0) return fd;
+  close(fd);
+  return -1;
+}
 
 size_t CountLines(const std::string& path) {
   const std::string text = ReadFile(path);
@@ -315,7 +301,63 @@ LineCount CountLogLine(const std::string& log, std::string_view line) {
   return count;
 }
 
-long ResidentKb(pid_t pid) { return StatusField(pid, "VmRSS:"); }
 long PeakResidentKb(pid_t pid) { return StatusField(pid, "VmHWM:"); }
+
+RunResult Tarvodctl(std::vector<std::string> args, std::string_view stdinText) {
+  args.insert(args.begin(), TarvodctlBinary());
+  return RunProgram(args, stdinText);
+}
+
+std::string TarvodTest::writeConfig(const ConfigEntries& extra, std::string_view globalsXml) const {
+  ConfigEntries entries;
+  for (const auto& [key, path] : {std::pair{"errorLogPath", errorLog},
+                                  {"structuredLogPath", records},
+                                  {"eventSocketPath", socket},
+                                  {"stateDirectory", dir.path()}}) {
+    const bool given = std::any_of(extra.begin(), extra.end(),
+                                   [&](const auto& entry) { return entry.first == key; });
+    if (!given) entries.emplace_back(key, Str(path));
+  }
+  for (const auto& entry : extra) {
+    if (!entry.second.empty()) entries.push_back(entry);
+  }
+  return dir.write("tarvod.plist", ConfigPlist(entries, globalsXml));
+}
+
+Daemon& TarvodTest::start(const std::vector<std::string>& rules, int level,
+                          const ConfigEntries& config, const std::vector<std::string>& launcher) {
+  const std::string configPath = writeConfig(config);
+  dir.write("rules.plist", RulesDocument(rules));
+  started = std::make_unique<Daemon>(std::vector<std::string>{"-c", configPath, "-r", rulesPath,
+                                                              "-v", std::to_string(level), "-n"},
+                                     dir, launcher);
+  if (level > 0) {
+    EXPECT_TRUE(started->waitForStartup(errorLog)) << started->stderrText() << ReadFile(errorLog);
+  }
+  return *started;
+}
+
+std::string TarvodTest::run(const std::vector<std::string>& rules, int level,
+                            const ConfigEntries& config,
+                            const std::function<void(Daemon&)>& whileRunning,
+                            const std::vector<std::string>& launcher) {
+  start(rules, level, config, launcher);
+  if (whileRunning) whileRunning(*started);
+  EXPECT_EQ(started->stop(), 0);
+  return ReadFile(errorLog);
+}
+
+std::string TarvodTest::runActions(std::vector<std::string> actions, int level,
+                                   const ConfigEntries& config,
+                                   const std::vector<std::string>& launcher) {
+  const std::string marker = dir.file("done");
+  actions.push_back(FileLog("done", marker));
+  return run(
+      {RuleXml("actions", {"startup.load"}, {{"actions", Arr(actions)}})}, level, config,
+      [&](Daemon& running) {
+        EXPECT_TRUE(running.waitForLine(marker, "done", 60s)) << ReadFile(errorLog);
+      },
+      launcher);
+}
 
 }  // namespace tarvod::testing

@@ -2,12 +2,14 @@
 // files, child processes and waiting for log lines. Test-thread only.
 #pragma once
 
+#include <gtest/gtest.h>
 #include <sys/types.h>
 
 #include <chrono>
 #include <csignal>
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -17,7 +19,6 @@ namespace tarvod::testing {
 using namespace std::chrono_literals;
 
 std::string ReadFile(const std::string& path);
-void WriteFile(const std::string& path, std::string_view content);
 bool FileExists(const std::string& path);
 
 // A fresh directory under /tmp, removed with everything in it at the end of the test.
@@ -32,7 +33,6 @@ class TempDir {
   std::string file(std::string_view name) const { return mPath + "/" + std::string(name); }
   // Writes a file (creating parent directories) and returns its full path.
   std::string write(std::string_view name, std::string_view content) const;
-  std::string read(std::string_view name) const { return ReadFile(file(name)); }
 
  private:
   std::string mPath;
@@ -41,10 +41,11 @@ class TempDir {
 std::string TarvodBinary();
 std::string TarvodctlBinary();
 
+using ConfigEntries = std::vector<std::pair<std::string, std::string>>;
+
 // An XML property list with a "config" dictionary built from XML fragments, for example
 // ConfigPlist({{"errorLogPath", "<string>/tmp/x</string>"}}).
-std::string ConfigPlist(const std::vector<std::pair<std::string, std::string>>& config,
-                        std::string_view initialGlobalsXml = {});
+std::string ConfigPlist(const ConfigEntries& config, std::string_view initialGlobalsXml = {});
 // Wraps dictionary/array XML in a plist document.
 std::string PlistDocument(std::string_view bodyXml);
 
@@ -56,6 +57,7 @@ struct RunResult {
 // Runs a program to completion (killed after timeout) and collects its output.
 RunResult RunProgram(const std::vector<std::string>& argv, std::string_view stdinText = {},
                      std::chrono::milliseconds timeout = 30s);
+RunResult Tarvodctl(std::vector<std::string> args, std::string_view stdinText = {});
 
 // A running tarvod. The destructor kills it if it is still running.
 class Daemon {
@@ -85,10 +87,15 @@ class Daemon {
   std::string stderrText() const;
 
  private:
+  bool waitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout);
+
   pid_t mPid = -1;
   int mStatus = -1;
   std::string mStderrPath;
 };
+
+// A datagram socket bound at path; -1 when it cannot be made.
+int BindUnixDatagram(const std::string& path);
 
 // Number of newline-terminated lines in a file; 0 when it cannot be read.
 size_t CountLines(const std::string& path);
@@ -109,8 +116,37 @@ struct LineCount {
 };
 LineCount CountLogLine(const std::string& log, std::string_view line);
 
-// Resident set size of a process in kB (VmRSS), and its peak (VmHWM); -1 when unknown.
-long ResidentKb(pid_t pid);
+// Peak resident set size of a process in kB (VmHWM); -1 when unknown.
 long PeakResidentKb(pid_t pid);
+
+// A daemon whose files all live in the test's directory: error.log, records.jsonl, the event
+// socket evtq and the state.
+class TarvodTest : public ::testing::Test {
+ protected:
+  // Writes tarvod.plist: the files above, then extra; an extra entry with empty XML leaves
+  // that default out, one with XML replaces it.
+  std::string writeConfig(const ConfigEntries& extra = {}, std::string_view globalsXml = {}) const;
+  // Starts the daemon (-n) on the rules at the debug level; from level 1 up, waits until its
+  // sources listen.
+  Daemon& start(const std::vector<std::string>& rules, int level, const ConfigEntries& config = {},
+                const std::vector<std::string>& launcher = {});
+  // start, then whileRunning, then a stop that must end with status 0; returns the error log.
+  std::string run(const std::vector<std::string>& rules, int level,
+                  const ConfigEntries& config = {},
+                  const std::function<void(Daemon&)>& whileRunning = {},
+                  const std::vector<std::string>& launcher = {});
+  // Runs the actions in a startup rule named "actions" until they have all run.
+  std::string runActions(std::vector<std::string> actions, int level,
+                         const ConfigEntries& config = {},
+                         const std::vector<std::string>& launcher = {});
+
+  TempDir dir;
+  const std::string errorLog = dir.file("error.log");
+  const std::string records = dir.file("records.jsonl");
+  const std::string socket = dir.file("evtq");
+  const std::string rulesPath = dir.file("rules.plist");
+  const std::string out = dir.file("out.log");
+  std::unique_ptr<Daemon> started;  // by start()
+};
 
 }  // namespace tarvod::testing
