@@ -1,6 +1,7 @@
 #include "engine/engine.h"
 
 #include <algorithm>
+#include <array>
 #include <atomic>
 #include <chrono>
 #include <filesystem>
@@ -39,48 +40,88 @@ void ForEachTypePrefix(std::string_view type, Visit visit) {
   }
 }
 
-// The one job of a type prefix that has rules: its rules in load order, then its record. The
-// context is made here, on the processing queue, so the copies it holds are made, used and
-// freed by one thread; the counter was taken at dispatch, so counts follow dispatch order.
-// On the serial queue the rules of one event's prefix run back to back, as they would as
-// separate jobs queued together.
-struct PrefixJob {
-  std::shared_ptr<const plist::Dictionary> event;
-  RulebasePtr rulebase;  // keeps entry and its key alive
-  const std::pair<const std::string, RulebaseEntry>* entry;
-  uint64_t count;
-  double now;
-  VariableStorePtr variables;
-  std::shared_ptr<Keychain> keychain;
-  DryRun* dryRun;
+// What the processing queue does for one prefix of an event's type: run its rules and write
+// its record (entry set), or only write the record of the full type, which has no rules.
+struct PrefixStep {
+  const std::pair<const std::string, RulebaseEntry>* entry;  // nullptr: the record alone
+  uint64_t count;  // the prefix's event counter including this event, taken at dispatch
+};
+
+// The one job of an event, with its steps in prefix order, longest first. The context is made
+// here, on the processing queue, so the copies it holds are made, used and freed by one thread;
+// the counters were taken at dispatch, so counts follow dispatch order. The event's records
+// share one gathering of its attributes. On the serial queue this runs what separate jobs
+// queued together would, in the same order.
+class EventJob {
+ public:
+  EventJob(std::shared_ptr<const plist::Dictionary> event, RulebasePtr rulebase, double now,
+           VariableStorePtr variables, std::shared_ptr<Keychain> keychain, DryRun* dryRun)
+      : mEvent(std::move(event)),
+        mRulebase(std::move(rulebase)),
+        mNow(now),
+        mVariables(std::move(variables)),
+        mKeychain(std::move(keychain)),
+        mDryRun(dryRun) {}
+
+  void add(PrefixStep step) {
+    if (mCount < mSteps.size()) {
+      mSteps[mCount++] = step;
+    } else {
+      mMore.push_back(step);
+    }
+  }
+  bool empty() const { return mCount == 0; }
 
   void operator()() const {
-    const std::string& prefix = entry->first;
-    const std::vector<RulePtr>& rules = entry->second.rules;
-    if (dryRun) dryRun->note("type prefix %s: %zu rules", prefix.c_str(), rules.size());
-    Context context(variables, rulebase, *event, keychain);
+    EventRecord record(*mEvent);
+    for (size_t i = 0; i < mCount; ++i) run(mSteps[i], record);
+    for (const PrefixStep& step : mMore) run(step, record);
+  }
+
+ private:
+  void run(const PrefixStep& step, EventRecord& record) const {
+    if (step.entry == nullptr) {
+      SerialQueue::BlockingSection blocking;
+      record.write(false, false);
+      return;
+    }
+    const std::string& prefix = step.entry->first;
+    const std::vector<RulePtr>& rules = step.entry->second.rules;
+    if (mDryRun) mDryRun->note("type prefix %s: %zu rules", prefix.c_str(), rules.size());
+    Context context(mVariables, mRulebase, *mEvent, mKeychain);
     plist::Dictionary& metadata = context.eventMetadata();
     metadata.reserve(2);
-    metadata.set(prefix + ":eventCounter", plist::Value::Integer(static_cast<int64_t>(count)));
-    metadata.set(prefix + ":lastEventTimestamp", plist::Value::Real(now));
+    metadata.set(prefix + ":eventCounter", plist::Value::Integer(static_cast<int64_t>(step.count)));
+    metadata.set(prefix + ":lastEventTimestamp", plist::Value::Real(mNow));
 
     bool fired = false;
     for (const RulePtr& rule : rules) {
       const auto start = std::chrono::steady_clock::now();
-      const bool didFire = ProcessRule(*rule, context, dryRun);
+      const bool didFire = ProcessRule(*rule, context, mDryRun);
       fired = fired || didFire;
-      if (dryRun == nullptr) {
+      if (mDryRun == nullptr) {
         const std::chrono::duration<double> spent = std::chrono::steady_clock::now() - start;
         Statistics().ruleRan(*rule, didFire, spent.count());
       }
     }
-    if (dryRun) return;
+    if (mDryRun) return;
     // The record touches no variable: a journal that stops taking records must not keep
     // shutdown from saving the store.
     SerialQueue::BlockingSection blocking;
     const bool hasRules = !rules.empty();
-    WriteEventRecord(*event, hasRules, hasRules && !fired);
+    record.write(hasRules, hasRules && !fired);
   }
+
+  std::shared_ptr<const plist::Dictionary> mEvent;
+  RulebasePtr mRulebase;  // keeps the entries and their keys alive
+  double mNow;
+  VariableStorePtr mVariables;
+  std::shared_ptr<Keychain> mKeychain;
+  DryRun* mDryRun;
+  // Nearly every event has one or two steps; a type of many components spills over.
+  std::array<PrefixStep, 3> mSteps{};
+  size_t mCount = 0;
+  std::vector<PrefixStep> mMore;
 };
 
 }  // namespace
@@ -156,6 +197,7 @@ void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned, 
   // One event shared by every job of this dispatch: the caller's own when it handed it over.
   const auto shared = owned ? std::make_shared<const plist::Dictionary>(std::move(*owned))
                             : std::make_shared<const plist::Dictionary>(event);
+  EventJob job(shared, rulebase, now, dryRun ? dryRun->variables : mVariables, mKeychain, dryRun);
   ForEachTypePrefix(type, [&](std::string_view prefix) {
     auto found = rulebase->find(prefix);
     if (found != rulebase->end()) {
@@ -169,22 +211,19 @@ void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned, 
         count = entry.eventCounter.fetch_add(1, std::memory_order_relaxed) + 1;
         entry.lastEventTimestamp.store(now, std::memory_order_relaxed);
       }
-      mQueue->async(PrefixJob{shared, rulebase, &*found, count, now,
-                              dryRun ? dryRun->variables : mVariables, mKeychain, dryRun});
+      job.add(PrefixStep{&*found, count});
       return;
     }
     if (prefix.size() == type.size() && dryRun == nullptr) {
       // The record of a type without rules is written by the processing queue too, in the
       // order of the queue's other records: the dispatching thread (the input queue) then
       // does no file or journal I/O of its own, and the record joins the queue's batch.
-      mQueue->async([shared] {
-        SerialQueue::BlockingSection blocking;
-        WriteEventRecord(*shared, false, false);
-      });
+      job.add(PrefixStep{nullptr, 0});
     }
     LogMessage(2, "  Dropping event %.*s because it has no associated rules",
                static_cast<int>(prefix.size()), prefix.data());
   });
+  if (!job.empty()) mQueue->async(std::move(job));
 }
 
 plist::Dictionary Engine::daemonEvent(const char* type) const {

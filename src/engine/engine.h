@@ -1,8 +1,8 @@
 // The rule engine: owns the processing queue "com.quenta.tarvod.processq", the current and
 // the previous rulebase and the variable store. dispatchEvent may be called from any thread
-// and never waits for rules: it queues one job per matching type prefix, which runs the
-// prefix's rules in load order and then writes its record, and one record job for a type
-// without rules. Everything else is called from the main thread.
+// and never waits for rules: it queues one job per event, which runs the rules of each
+// matching type prefix in load order, writing each prefix's record after its rules (and the
+// record of a full type without rules). Everything else is called from the main thread.
 #pragma once
 
 #include <atomic>

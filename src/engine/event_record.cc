@@ -30,12 +30,13 @@ constexpr size_t kLinearAttributes = 16;
 // (every usual event), through an index once it grows.
 class Record {
  public:
-  bool set(std::string_view name, std::string_view value) {
+  // The index the attribute has; -1 when the record cannot take another.
+  ptrdiff_t set(std::string_view name, std::string_view value) {
     if (mAttributes.size() < kLinearAttributes) {
-      for (auto& attribute : mAttributes) {
-        if (attribute.first == name) {
-          attribute.second = value;
-          return true;
+      for (size_t i = 0; i < mAttributes.size(); ++i) {
+        if (mAttributes[i].first == name) {
+          mAttributes[i].second = value;
+          return static_cast<ptrdiff_t>(i);
         }
       }
     } else {
@@ -45,14 +46,15 @@ class Record {
       auto found = mIndex.find(name);
       if (found != mIndex.end()) {
         mAttributes[found->second].second = value;
-        return true;
+        return static_cast<ptrdiff_t>(found->second);
       }
-      if (mAttributes.size() >= kMaxRecordAttributes) return false;
+      if (mAttributes.size() >= kMaxRecordAttributes) return -1;
       mIndex.emplace(name, mAttributes.size());
     }
     mAttributes.emplace_back(name, value);
-    return true;
+    return static_cast<ptrdiff_t>(mAttributes.size() - 1);
   }
+  void assign(size_t index, std::string_view value) { mAttributes[index].second = value; }
   // The text form of value, kept as long as the record.
   std::string_view text(const plist::Value& value) {
     if (const std::string* string = value.asString()) return *string;
@@ -87,50 +89,100 @@ std::pair<uint64_t, uint64_t> UnixTime(double since2001) {
   return {seconds, nanoseconds};
 }
 
-bool Configure(Record& record, std::string_view name, std::string_view value) {
-  if (record.set(name, value)) return true;
-  LogMessage(0, "Failed to configure KVLOG message with key %.*s", static_cast<int>(name.size()),
-             name.data());
-  return false;
+// Sets one attribute; false, with the failure logged, when the record cannot take it.
+ptrdiff_t Configure(Record& record, std::string_view name, std::string_view value) {
+  const ptrdiff_t index = record.set(name, value);
+  if (index < 0) {
+    LogMessage(0, "Failed to configure KVLOG message with key %.*s", static_cast<int>(name.size()),
+               name.data());
+  }
+  return index;
 }
 
 }  // namespace
 
-void WriteEventRecord(const plist::Dictionary& event, bool hasRules, bool eventBlocked) {
-  const plist::Value* typeValue = event.find("eventType");
-  const std::string type = typeValue ? typeValue->textForm() : "(null)";
-  LogMessage(4, "Logging event %s to KVLOG tarvod database", type.c_str());
-
+struct EventRecord::Attributes {
+  std::string type;
   Record record;
+  // Where the flags go; failed holds the key the record could not take, if any.
+  size_t hasRules = 0;
+  size_t eventBlocked = 0;
+  std::string failed;
+  bool complete = false;
+};
+
+EventRecord::EventRecord(const plist::Dictionary& event) : mEvent(event) {}
+
+EventRecord::~EventRecord() = default;
+
+void EventRecord::write(bool hasRules, bool eventBlocked) {
+  const bool first = !mAttributes;
+  if (first) {
+    mAttributes = std::make_unique<Attributes>();
+    const plist::Value* typeValue = mEvent.find("eventType");
+    mAttributes->type = typeValue ? typeValue->textForm() : "(null)";
+  }
+  Attributes& a = *mAttributes;
+  LogMessage(4, "Logging event %s to KVLOG tarvod database", a.type.c_str());
+  if (first) {
+    a.complete = Gather(mEvent, a);
+  } else if (!a.complete) {
+    // Each record the event would have had reports the refusal, as the first one did.
+    LogMessage(0, "Failed to configure KVLOG message with key %s", a.failed.c_str());
+  }
+  if (!a.complete) return;
+  a.record.assign(a.hasRules, hasRules ? "true" : "false");
+  a.record.assign(a.eventBlocked, eventBlocked ? "true" : "false");
+
+  const std::string message = a.type + " hasRules=" + (hasRules ? "true" : "false") +
+                              " eventBlocked=" + (eventBlocked ? "true" : "false");
+  if (!DefaultStructuredLog().sendAttributes(kRecordPriority, message, a.record.attributes())) {
+    LogMessage(0, "Failed to log event %s to KVLOG tarvod database", a.type.c_str());
+  }
+}
+
+// The event's keys and details flattened, the time split into seconds and nanoseconds, then
+// the flags and the level. A later value for a name replaces the earlier one in place, so an
+// event key named like a flag holds the flag's place.
+bool EventRecord::Gather(const plist::Dictionary& event, Attributes& a) {
+  Record& record = a.record;
   // Room for the event's keys, its details and the five the record adds, in one allocation.
   const plist::Dictionary* lifted = event.findDictionary("eventDetails");
   record.reserve(event.size() + (lifted ? lifted->size() : 0) + 5);
+  const auto add = [&](std::string_view name, std::string_view value) {
+    const ptrdiff_t index = Configure(record, name, value);
+    if (index < 0) a.failed = std::string(name);
+    return index;
+  };
   for (const auto& [key, value] : event) {
     if (key == "eventDetails") {
       if (const plist::Dictionary* details = value.asDictionary()) {
         for (const auto& [detailKey, detailValue] : *details) {
-          if (!Configure(record, detailKey, record.text(detailValue))) return;
+          if (add(detailKey, record.text(detailValue)) < 0) return false;
         }
-      } else if (!Configure(record, key, record.text(value))) {
-        return;  // details that are not a dictionary are kept as one attribute
+      } else if (add(key, record.text(value)) < 0) {
+        return false;  // details that are not a dictionary are kept as one attribute
       }
     } else if (key == "eventTimestamp") {
       const auto [seconds, nanoseconds] = UnixTime(value.numberValue());
-      if (!Configure(record, "Time", record.keep(std::to_string(seconds)))) return;
-      if (!Configure(record, "TimeNanoSec", record.keep(std::to_string(nanoseconds)))) return;
-    } else if (!Configure(record, key, record.text(value))) {
-      return;
+      if (add("Time", record.keep(std::to_string(seconds))) < 0) return false;
+      if (add("TimeNanoSec", record.keep(std::to_string(nanoseconds))) < 0) return false;
+    } else if (add(key, record.text(value)) < 0) {
+      return false;
     }
   }
-  if (!Configure(record, "hasRules", hasRules ? "true" : "false")) return;
-  if (!Configure(record, "eventBlocked", eventBlocked ? "true" : "false")) return;
-  if (!Configure(record, "Level", "Alert")) return;
+  const ptrdiff_t hasRules = add("hasRules", "false");
+  if (hasRules < 0) return false;
+  const ptrdiff_t eventBlocked = add("eventBlocked", "false");
+  if (eventBlocked < 0) return false;
+  if (add("Level", "Alert") < 0) return false;
+  a.hasRules = static_cast<size_t>(hasRules);
+  a.eventBlocked = static_cast<size_t>(eventBlocked);
+  return true;
+}
 
-  const std::string message = type + " hasRules=" + (hasRules ? "true" : "false") +
-                              " eventBlocked=" + (eventBlocked ? "true" : "false");
-  if (!DefaultStructuredLog().sendAttributes(kRecordPriority, message, record.attributes())) {
-    LogMessage(0, "Failed to log event %s to KVLOG tarvod database", type.c_str());
-  }
+void WriteEventRecord(const plist::Dictionary& event, bool hasRules, bool eventBlocked) {
+  EventRecord(event).write(hasRules, eventBlocked);
 }
 
 }  // namespace tarvod
