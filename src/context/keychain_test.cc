@@ -1,5 +1,4 @@
-// Keychain variables against real store files (the tests run as root, as the daemon does):
-// lookups, the root-only rule, re-reading a changed store, and secrets kept out of traces.
+// Against real store files: the tests run as root, as the daemon does.
 #include "context/keychain.h"
 
 #include <fcntl.h>

@@ -1,10 +1,4 @@
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <unistd.h>
-
-#include <cstdlib>
-#include <fstream>
-#include <sstream>
 
 #include "context/context.h"
 #include "platform/diagnostic_log.h"
@@ -22,13 +16,10 @@ constexpr const char* kFile = "/etc/tarvod.d/rules/a.plist";
 class LookupTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    dir_ = capture_.directory();
     SetDebugLevel(0);
-
     variables_ = std::make_shared<VariableStore>(VariableStore{
         {kGlobalsKey, Dictionary{{"g", "global value"}, {"shared", "from globals"}}},
         {kFile, Dictionary{{"x", Value::Real(3.7)},
-                           {"h", Value::Integer(255)},
                            {"name", "alpha"},
                            {"x ", "with blank"},
                            {"a%b", Value::Integer(7)},
@@ -51,7 +42,6 @@ class LookupTest : public ::testing::Test {
     return file ? file->find(name) : nullptr;
   }
   testing::LogCapture capture_;
-  std::string dir_;
   VariableStorePtr variables_;
   std::unique_ptr<Context> context_;
 };
@@ -69,12 +59,8 @@ TEST_F(LookupTest, ReferencesFindTheirNamespaceAndApplyTheirSuffix) {
       {"x\u00a0%d", kFile, Value("3")},    // Unicode white space is trimmed too
       {"a%b%d", kFile, Value("7")},        // the suffix starts at the last "%"
       {"x ", kFile, Value("with blank")},  // without "%" the name is taken as written
-      {"x%d", kFile, Value("3")},
-      {"h%x", kFile, Value("ff")},
-      {"x%@", kFile, Value::Real(3.7)},
-      {"x%", kFile, Value::Real(3.7)},  // a lone "%" is an empty suffix
-      {"name%t", kFile, Value(referenceDate)},
-      {"missing%d", kFile, Value("0")},  // absent counts as 0 for a converting suffix
+      {"x%", kFile, Value::Real(3.7)},     // a lone "%" is an empty suffix
+      {"missing%d", kFile, Value("0")},    // absent counts as 0 for a converting suffix
       {"missing", kFile, std::nullopt},
       {"", kFile, std::nullopt},
       {"g", kFile, std::nullopt},  // no fallback from file-local to global
@@ -106,6 +92,7 @@ TEST_F(LookupTest, EventReferencesOfAContextWithoutAnEventHaveNoValue) {
   Context context(variables_, std::make_shared<Rulebase>());
   EXPECT_EQ(context.variableValueForKey("event:eventType", kFile), std::nullopt);
   EXPECT_EQ(context.variableValueForKey("builtin:eventDictionary", kFile), std::nullopt);
+  EXPECT_EQ(context.variableValueForKey("builtin:event", kFile), std::nullopt);
   EXPECT_EQ(context.variableValueForKey("x", kFile), Value::Real(3.7));
 }
 
@@ -125,16 +112,10 @@ TEST_F(LookupTest, AssignedStringsBecomeNumbersOnlyWhenPurelyArithmetic) {
     std::optional<Value> stored;
   };
   const Case cases[] = {
-      {Value("42"), Value::Integer(42)},
-      {Value(" 7 "), Value::Integer(7)},
       {Value("3 * (2 + 1)"), Value::Integer(9)},
-      {Value("100 / 4"), Value::Integer(25)},
       {Value("-2.5"), Value::Real(-2.5)},
-      {Value("1 2"), Value("1 2")},  // fails to evaluate, kept as text
-      {Value("12:30"), Value("12:30")},
-      {Value("10 pears"), Value("10 pears")},
-      {Value("()"), Value("()")},  // no digit
-      {Value(""), Value("")},
+      {Value("1 2"), Value("1 2")},           // fails to evaluate, kept as text
+      {Value("12:30"), Value("12:30")},       // not arithmetic at all
       {Value("${undefined}"), std::nullopt},  // a whole-text reference without value removes
       {Value("x${undefined}"), Value("x0")},
       {Value("${name}"), Value("alpha")},
@@ -155,17 +136,14 @@ TEST_F(LookupTest, AssignedStringsBecomeNumbersOnlyWhenPurelyArithmetic) {
   }
 }
 
-TEST_F(LookupTest, ADateWrittenWithSlashesIsEvaluatedAsDivisions) {
-  context_->setVariableValue(Value("12/25/2008"), "v", kFile);
-  ASSERT_NE(Local("v"), nullptr);
-  ASSERT_TRUE(Local("v")->isReal());
-  EXPECT_DOUBLE_EQ(Local("v")->real(), 12.0 / 25.0 / 2008.0);
-}
-
-TEST_F(LookupTest, AFailedEvaluationIsLoggedAndTheStringKept) {
+TEST_F(LookupTest, FailuresKeepTheStringOrThePreviousValueAndAreLogged) {
+  context_->setVariableValue(Value("${name"), "name", kFile);
+  EXPECT_EQ(*Local("name"), Value("alpha"));
   context_->setVariableValue(Value("1 2"), "v", kFile);
   EXPECT_EQ(*Local("v"), Value("1 2"));
   const std::string log = Log();
+  EXPECT_NE(log.find("Error: Unterminated token starting at index 0 in string: ${name\n"),
+            std::string::npos);
   EXPECT_NE(log.find("initial value = 1 2\n"
                      "after resolveVarsInString value = 1 2\n"
                      "Exception thrown while evaluating expression: 1 2\n"),
@@ -217,13 +195,6 @@ TEST_F(LookupTest, RefusedNamesStoreNothingAndSayWhy) {
     EXPECT_EQ(*variables_, before) << c.name;
     EXPECT_EQ(Log().substr(logBefore.size()), c.message) << c.name;
   }
-}
-
-TEST_F(LookupTest, AValueThatFailsToResolveKeepsThePreviousOne) {
-  context_->setVariableValue(Value("${name"), "name", kFile);
-  EXPECT_EQ(*Local("name"), Value("alpha"));
-  EXPECT_NE(Log().find("Error: Unterminated token starting at index 0 in string: ${name\n"),
-            std::string::npos);
 }
 
 TEST_F(LookupTest, AssignmentsAreVisibleToEveryContextOfTheStore) {

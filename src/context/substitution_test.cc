@@ -1,10 +1,4 @@
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <unistd.h>
-
-#include <cstdlib>
-#include <fstream>
-#include <sstream>
 
 #include "context/context.h"
 #include "platform/diagnostic_log.h"
@@ -22,7 +16,6 @@ constexpr const char* kFile = "/etc/tarvod.d/rules/s.plist";
 class SubstitutionTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    dir_ = capture_.directory();
     SetDebugLevel(6);
     variables_ = std::make_shared<VariableStore>(VariableStore{
         {kGlobalsKey, Dictionary{}},
@@ -38,7 +31,6 @@ class SubstitutionTest : public ::testing::Test {
   }
   std::string Log() const { return capture_.text(); }
   testing::LogCapture capture_;
-  std::string dir_;
   VariableStorePtr variables_;
   std::unique_ptr<Context> context_;
 };
@@ -90,37 +82,31 @@ TEST_F(SubstitutionTest, MalformedTextFailsWithEveryMessage) {
   const std::string six = "${a${b${c${d${e${f}}}}}}";
   std::string braces;
   for (size_t i = 0; i < 1'000'000; ++i) braces += "${";
+  // Every unterminated "${", innermost first, after the nesting message when there is one.
   struct Case {
     std::string text;
-    std::vector<std::string> messages;
+    bool tooDeep;
+    std::vector<int> unterminatedAt;
   };
   const Case cases[] = {
-      {"price: ${p", {"Unterminated token starting at index 7 in string: price: ${p"}},
-      {"${a${b",
-       {"Unterminated token starting at index 3 in string: ${a${b",
-        "Unterminated token starting at index 0 in string: ${a${b"}},
+      {"price: ${p", false, {7}},
+      {"${a${b", false, {3, 0}},
       // Positions count UTF-16 code units of the text as it stands after earlier replacements.
-      {"é${p", {"Unterminated token starting at index 1 in string: é${p"}},
-      {"\U0001F600${p", {"Unterminated token starting at index 2 in string: \U0001F600${p"}},
-      {"${h}é${p", {"Unterminated token starting at index 6 in string: ${h}é${p"}},
-      {six,
-       {"String exceeded the maximum allowable levels of variable nesting (5): " + six,
-        "Unterminated token starting at index 12 in string: " + six,
-        "Unterminated token starting at index 9 in string: " + six,
-        "Unterminated token starting at index 6 in string: " + six,
-        "Unterminated token starting at index 3 in string: " + six,
-        "Unterminated token starting at index 0 in string: " + six}},
-      {braces,
-       {"String exceeded the maximum allowable levels of variable nesting (5): " + braces,
-        "Unterminated token starting at index 8 in string: " + braces,
-        "Unterminated token starting at index 6 in string: " + braces,
-        "Unterminated token starting at index 4 in string: " + braces,
-        "Unterminated token starting at index 2 in string: " + braces,
-        "Unterminated token starting at index 0 in string: " + braces}},
+      {"é${p", false, {1}},
+      {"\U0001F600${p", false, {2}},
+      {"${h}é${p", false, {6}},
+      {six, true, {12, 9, 6, 3, 0}},
+      {braces, true, {8, 6, 4, 2, 0}},
   };
   for (const Case& c : cases) {
     std::string expected;
-    for (const std::string& m : c.messages) expected += (expected.empty() ? "" : "\n") + m;
+    if (c.tooDeep) {
+      expected = "String exceeded the maximum allowable levels of variable nesting (5): " + c.text;
+    }
+    for (int at : c.unterminatedAt) {
+      expected += (expected.empty() ? "" : "\n") + ("Unterminated token starting at index " +
+                                                    std::to_string(at) + " in string: " + c.text);
+    }
     ErrorSlot error;
     EXPECT_EQ(context_->resolveVariablesInString(c.text, kFile, &error), std::nullopt);
     ASSERT_TRUE(error) << c.text.substr(0, 40);
@@ -181,9 +167,6 @@ TEST_F(SubstitutionTest, ArraysOmitAbsentElementsAndFailOnErrors) {
   }
   EXPECT_NE(Log().find("The array object ${x} could not be resolved and was omitted.\n"),
             std::string::npos);
-}
-
-TEST_F(SubstitutionTest, AnArrayFailsWithoutACallersSlotToo) {
   EXPECT_EQ(context_->resolveVariablesInArray(Array{"${x", "b"}, kFile, nullptr), std::nullopt);
 }
 
