@@ -64,14 +64,10 @@ TEST(Arithmetic, HandlesHundredThousandNestedParenthesesWithoutRecursion) {
 }
 
 TEST(Arithmetic, CandidatesNeedADigitAndOnlyArithmeticCharacters) {
-  EXPECT_TRUE(IsArithmeticCandidate("42"));
-  EXPECT_TRUE(IsArithmeticCandidate("12/25/2008"));
-  EXPECT_TRUE(IsArithmeticCandidate("1 2"));
-  EXPECT_FALSE(IsArithmeticCandidate("()"));
-  EXPECT_FALSE(IsArithmeticCandidate(""));
-  EXPECT_FALSE(IsArithmeticCandidate("12:30"));
-  EXPECT_FALSE(IsArithmeticCandidate("10 pears"));
-  EXPECT_FALSE(IsArithmeticCandidate("1e3"));
+  for (const char* text : {"42", "12/25/2008", "1 2"}) EXPECT_TRUE(IsArithmeticCandidate(text));
+  for (const char* text : {"()", "", "12:30", "10 pears", "1e3"}) {
+    EXPECT_FALSE(IsArithmeticCandidate(text)) << text;
+  }
 }
 
 }  // namespace

@@ -1,14 +1,12 @@
 #include "context/context.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <unistd.h>
 
-#include <cstdlib>
 #include <fstream>
-#include <sstream>
 
+#include "context/builtins.h"
 #include "platform/diagnostic_log.h"
+#include "platform/host_stats.h"
 #include "platform/testing/log_capture.h"
 
 namespace tarvod {
@@ -17,7 +15,6 @@ namespace {
 using plist::Dictionary;
 using plist::Value;
 
-// Points the error log at a temporary file for the test's duration.
 class ContextTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -46,6 +43,7 @@ TEST(ColonEscapes, FollowTheOddBackslashRunConvention) {
       {"12:30", R"(12\:30)", "12:30", true},
       {R"(12\:30)", R"(12\:30)", "12:30", false},
       {"a:b:c", R"(a\:b\:c)", "a:b:c", true},
+      {"é::", R"(é\:\:)", "é::", true},
       {R"(a\\:b)", R"(a\\\:b)", R"(a\\:b)", true},
       {R"(a\\\:b)", R"(a\\\:b)", R"(a\\:b)", false},
       {":", R"(\:)", ":", true},
@@ -56,14 +54,10 @@ TEST(ColonEscapes, FollowTheOddBackslashRunConvention) {
     EXPECT_EQ(EscapeColonsInEventString(c.text), c.escaped) << c.text;
     EXPECT_EQ(UnescapeColonsInString(c.text), c.unescaped) << c.text;
     EXPECT_EQ(UnescapedColonsInString(c.text), c.hasUnescapedColon) << c.text;
-  }
-}
-
-TEST(ColonEscapes, UnescapingUndoesEscapingOfTextWithoutEscapedColons) {
-  for (const char* text : {"a:b", "::", R"(a\\:b)", "host:8080:x", R"(\\\\:)", "é:ü"}) {
-    const std::string escaped = EscapeColonsInEventString(text);
-    EXPECT_FALSE(UnescapedColonsInString(escaped)) << text;
-    EXPECT_EQ(UnescapeColonsInString(escaped), text);
+    // Unescaping undoes escaping of text without escaped colons.
+    if (c.text != c.unescaped) continue;
+    EXPECT_FALSE(UnescapedColonsInString(c.escaped)) << c.text;
+    EXPECT_EQ(UnescapeColonsInString(c.escaped), c.text);
   }
 }
 
@@ -126,9 +120,6 @@ TEST_F(ContextTest, ImportOfAnEventWithManyKeysKeepsEveryKeyOnce) {
 TEST_F(ContextTest, DescriptionPrintsEventVariablesAndRulebase) {
   auto variables = std::make_shared<VariableStore>(
       VariableStore{{kGlobalsKey, Dictionary{{"g", Value::Integer(1)}}}});
-  Context without(variables, std::make_shared<Rulebase>());
-  EXPECT_EQ(without.description(),
-            "event = (null) \n variables = " + plist::Describe(*variables) + " \n rulebase = {}");
   Context with(variables, std::make_shared<Rulebase>(), Dictionary{{"eventType", "a"}});
   EXPECT_EQ(with.description(), "event = " + plist::Describe(*with.event()) + " \n variables = " +
                                     plist::Describe(*variables) + " \n rulebase = {}");
@@ -147,19 +138,91 @@ TEST_F(ContextTest, StatisticsAreTakenAtFirstUseAndThenKept) {
   EXPECT_EQ(context.stats(), first);
   EXPECT_EQ(context.stats()->counters[0], freePages);
   EXPECT_EQ(context.variableValueForKey("builtin:system:memory:free", ""),
-            context.variableValueForKey("builtin:system:memory:free", ""));
+            Value(std::to_string(freePages * HostPageSize())));
 }
 
 TEST_F(ContextTest, AContextWithoutStatisticsServesEveryOtherVariable) {
   SetMeminfoPathForTesting(dir_ + "/missing");
-  auto variables = std::make_shared<VariableStore>();
-  Context context(variables, std::make_shared<Rulebase>(), Dictionary{{"eventType", "a"}});
-  EXPECT_EQ(context.stats(), nullptr);
+  Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>(),
+                  Dictionary{{"eventType", "a"}});
   EXPECT_EQ(context.stats(), nullptr);
   context.setVariableValue(Value("1"), "global:g", "");
-  EXPECT_EQ(context.variableValueForKey("builtin:system:memory:free", ""), Value("rule-error"));
+  for (const char* key : {"builtin:system:memory:free", "builtin:system:cpu:load"}) {
+    EXPECT_EQ(context.variableValueForKey(key, ""), Value("rule-error")) << key;
+  }
+  EXPECT_EQ(context.variableValueForKey("builtin:hostName", ""), Value(HostName()));
   EXPECT_EQ(context.variableValueForKey("global:g", ""), Value::Integer(1));
   EXPECT_EQ(context.variableValueForKey("event:eventType", ""), Value("a"));
+}
+
+double Number(const std::optional<Value>& v) { return v ? v->numberValue() : -1; }
+
+TEST_F(ContextTest, IntervalsAreHoursMinutesAndFractionalSecondsWithoutRangeLimits) {
+  EXPECT_DOUBLE_EQ(ParseInterval("01:30:00", true), 5400);
+  EXPECT_DOUBLE_EQ(ParseInterval("00:00:01.5", false), -1.5);
+  EXPECT_DOUBLE_EQ(ParseInterval("0:90:75", true), 5475);
+  EXPECT_DOUBLE_EQ(ParseInterval("-1:00:00", true), -3600);
+  // Malformed intervals count as zero and are logged.
+  EXPECT_EQ(ParseInterval("90", true), 0);
+  EXPECT_EQ(ParseInterval("1:2:3:4", true), 0);
+  EXPECT_EQ(Log(),
+            "ParseInterval: interval string is malformed, expecting  HH:MM:SS.SSS got 90\n"
+            "ParseInterval: interval string is malformed, expecting  HH:MM:SS.SSS got 1:2:3:4\n");
+}
+
+TEST_F(ContextTest, NowAndItsOffsetsAreSecondsSince2001) {
+  Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>());
+  const auto now = context.valueForBuiltinVariableKey("now");
+  ASSERT_TRUE(now && now->isString());
+  // "%f": fixed point with six decimals.
+  EXPECT_EQ(now->string().size() - now->string().find('.'), 7u);
+  EXPECT_NEAR(Number(now), SecondsSince2001Now(), 60);
+  EXPECT_NEAR(Number(context.valueForBuiltinVariableKey("now+01:30:00")) - Number(now), 5400, 60);
+  EXPECT_NEAR(Number(context.valueForBuiltinVariableKey("nowX00:10:00")) - Number(now), -600, 60);
+  EXPECT_NEAR(Number(context.valueForBuiltinVariableKey("nowhere")), Number(now), 60);
+  EXPECT_NE(Log().find("got ere\n"), std::string::npos);
+}
+
+TEST_F(ContextTest, MemoryKeysAreMatchedByTheirEnding) {
+  StatContext stats;
+  stats.counters[0] = 1;  // free
+  stats.counters[1] = 2;  // active
+  stats.counters[2] = 4;  // inactive
+  stats.counters[3] = 8;  // wired
+  stats.count = 4;
+  const uint64_t page = HostPageSize();
+  const std::pair<const char*, std::string> cases[] = {
+      {"system:memory:free", std::to_string(1 * page)},
+      {"system:memory:active", std::to_string(2 * page)},
+      {"system:memory:inactive", std::to_string(4 * page)},
+      {"system:memory:wired", std::to_string(8 * page)},
+      {"system:memory:used", std::to_string(14 * page)},
+      {"system:memory:unused", std::to_string(14 * page)},
+      {"system:memory:installed", "not-implemented"},
+      {"system:memory:pageins", "not-implemented"},
+      {"system:memory:pageouts", "not-implemented"},
+      {"system:memory:other", "not-implemented"},
+      {"system:cpu:load", "not-implemented"},
+  };
+  for (const auto& [key, expected] : cases)
+    EXPECT_EQ(SystemStatForKey(key, stats), expected) << key;
+}
+
+TEST_F(ContextTest, SystemHostAndEventKeys) {
+  WriteMeminfo(8);
+  Context context(std::make_shared<VariableStore>(), std::make_shared<Rulebase>());
+  EXPECT_EQ(context.valueForBuiltinVariableKey("system:memory:free"),
+            Value(std::to_string(8 * 1024 / HostPageSize() * HostPageSize())));
+  EXPECT_EQ(context.valueForBuiltinVariableKey("hostIP"),
+            context.valueForBuiltinVariableKey("hostIPv6"));
+  EXPECT_EQ(context.valueForBuiltinVariableKey("Now"), std::nullopt);  // names are case-sensitive
+
+  const plist::Dictionary event{{"eventType", "a.b"},
+                                {"eventDetails", plist::Dictionary{{"x", "1"}}}};
+  Context withEvent(std::make_shared<VariableStore>(), std::make_shared<Rulebase>(), event);
+  const auto dictionary = withEvent.valueForBuiltinVariableKey("eventDictionary");
+  ASSERT_TRUE(dictionary && dictionary->isDictionary());
+  EXPECT_EQ(*dictionary->dictionary().findString("x"), "1");
 }
 
 }  // namespace

@@ -1,9 +1,5 @@
-// The Engine: rules of events dispatched from several threads take turns on the processing
-// queue (were two ever to run at once, updates of the shared global would be lost and
-// ThreadSanitizer, which runs this test, would report it), a rulebase swapped during dispatch
-// is seen whole, a drain that times out still lets the store be reached, and every context
-// reads the engine's keychain.
-
+// Were two rules ever to run at once, updates of the shared global would be lost (and
+// ThreadSanitizer, which runs this test, would report the race).
 #include "engine/engine.h"
 
 #include <fcntl.h>
@@ -40,10 +36,17 @@ RulePtr CountingRule(const char* name, Dictionary extra = {}) {
 
 int64_t Count(Engine& engine) {
   int64_t count = -1;
-  engine.withVariables([&](VariableStore& store) {
+  EXPECT_TRUE(engine.withVariables([&](VariableStore& store) {
     count = store.findDictionary(kGlobalsKey)->find("count")->integerValue();
-  });
+  }));
   return count;
+}
+
+// A rulebase with the given rules for each event type.
+std::shared_ptr<Rulebase> Rules(std::initializer_list<std::pair<const char*, RulePtr>> rules) {
+  auto rulebase = std::make_shared<Rulebase>();
+  for (const auto& [type, rule] : rules) (*rulebase)[type].rules.push_back(rule);
+  return rulebase;
 }
 
 class EngineTest : public ::testing::Test {
@@ -58,9 +61,9 @@ class EngineTest : public ::testing::Test {
 };
 
 TEST_F(EngineTest, EventsFromTwoThreadsNeverRunRulesAtTheSameTime) {
-  auto rulebase = std::make_shared<Rulebase>();
-  (*rulebase)["tick"].rules = {CountingRule("first"), CountingRule("second")};
-  (*rulebase)["tick.fast"].rules = {CountingRule("third")};
+  const auto rulebase = Rules({{"tick", CountingRule("first")},
+                               {"tick", CountingRule("second")},
+                               {"tick.fast", CountingRule("third")}});
   engine_.swapRulebase(rulebase);
 
   constexpr int kEventsPerThread = 150;
@@ -85,11 +88,7 @@ TEST_F(EngineTest, EventsFromTwoThreadsNeverRunRulesAtTheSameTime) {
 }
 
 TEST_F(EngineTest, EveryEventSeesAWholeRulebaseWhileRulebasesAreSwapped) {
-  const auto makeRulebase = [] {
-    auto rulebase = std::make_shared<Rulebase>();
-    (*rulebase)["tick"].rules = {CountingRule("count")};
-    return rulebase;
-  };
+  const auto makeRulebase = [] { return Rules({{"tick", CountingRule("count")}}); };
   engine_.swapRulebase(makeRulebase());
   constexpr int kEvents = 3000;
   std::thread sender([&] {
@@ -101,9 +100,7 @@ TEST_F(EngineTest, EveryEventSeesAWholeRulebaseWhileRulebasesAreSwapped) {
 }
 
 TEST_F(EngineTest, EventsAfterCloseDispatchReachNoRule) {
-  auto rulebase = std::make_shared<Rulebase>();
-  (*rulebase)["tick"].rules = {CountingRule("count")};
-  engine_.swapRulebase(rulebase);
+  engine_.swapRulebase(Rules({{"tick", CountingRule("count")}}));
   engine_.dispatchEvent({{"eventType", "tick"}});
   engine_.closeDispatch();
   engine_.dispatchEvent({{"eventType", "tick"}});
@@ -112,8 +109,7 @@ TEST_F(EngineTest, EventsAfterCloseDispatchReachNoRule) {
   EXPECT_EQ(testing::ReadJsonRecords(records_).size(), 1u);
 }
 
-// Every context the engine makes reads the same keychain, on the processing queue; loading
-// rules (a reload) makes it read the store again even when its inode and time are unchanged.
+// A reload reads the store again even when its inode and time are unchanged.
 TEST_F(EngineTest, ContextsReadTheEnginesKeychainAndLoadingRulesRereadsIt) {
   const std::string store = capture_.directory() + "/system.keychain";
   auto writeStore = [&](const char* password) {
@@ -127,10 +123,9 @@ TEST_F(EngineTest, ContextsReadTheEnginesKeychainAndLoadingRulesRereadsIt) {
   };
   writeStore("first");
   engine_.setKeychain(std::make_shared<Keychain>(store));
-  auto rulebase = std::make_shared<Rulebase>();
-  (*rulebase)["tick"].rules = {
-      CountingRule("copy", {{"variables", Dictionary{{"global:pw", "${keychain:relay@mail}"}}}})};
-  engine_.swapRulebase(rulebase);
+  const RulePtr copy =
+      CountingRule("copy", {{"variables", Dictionary{{"global:pw", "${keychain:relay@mail}"}}}});
+  engine_.swapRulebase(Rules({{"tick", copy}}));
   auto password = [&] {
     engine_.dispatchEvent({{"eventType", "tick"}});
     std::string found;
@@ -148,9 +143,7 @@ TEST_F(EngineTest, ContextsReadTheEnginesKeychainAndLoadingRulesRereadsIt) {
 }
 
 TEST_F(EngineTest, ADrainThatTimesOutDropsTheRestAndStillReachesTheStore) {
-  auto rulebase = std::make_shared<Rulebase>();
-  (*rulebase)["tick"].rules = {CountingRule("count")};
-  engine_.swapRulebase(rulebase);
+  engine_.swapRulebase(Rules({{"tick", CountingRule("count")}}));
   engine_.dispatchEvent({{"eventType", "tick"}});
   // An action stuck in a blocking call, as a write to a file nobody drains would be.
   std::atomic<bool> release{false};
@@ -161,11 +154,7 @@ TEST_F(EngineTest, ADrainThatTimesOutDropsTheRestAndStillReachesTheStore) {
   for (int i = 0; i < 5; ++i) engine_.dispatchEvent({{"eventType", "tick"}});
 
   EXPECT_EQ(engine_.drain(0.2), 6u);  // the stuck job and the five events' jobs
-  int64_t count = -1;
-  EXPECT_TRUE(engine_.withVariables([&](VariableStore& store) {
-    count = store.findDictionary(kGlobalsKey)->find("count")->integerValue();
-  }));
-  EXPECT_EQ(count, 1);
+  EXPECT_EQ(Count(engine_), 1);
 
   // The stuck job finishes; the dropped jobs never run.
   release = true;
@@ -176,10 +165,7 @@ TEST_F(EngineTest, ADrainThatTimesOutDropsTheRestAndStillReachesTheStore) {
 
 TEST_F(EngineTest, EmptyComponentsOfATypeArePrefixesAndATypelessEventLeavesNoTrace) {
   SetDebugLevel(2);
-  auto rulebase = std::make_shared<Rulebase>();
-  (*rulebase)["a."].rules = {CountingRule("a dot")};
-  (*rulebase)[""].rules = {CountingRule("empty type")};
-  engine_.swapRulebase(rulebase);
+  engine_.swapRulebase(Rules({{"a.", CountingRule("a dot")}, {"", CountingRule("empty type")}}));
   engine_.dispatchEvent({{"eventDetails", Dictionary{{"a", "b"}}}});
   engine_.dispatchEvent({{"eventType", "a..b"}});
   EXPECT_EQ(Count(engine_), 1);
@@ -193,9 +179,7 @@ TEST_F(EngineTest, EmptyComponentsOfATypeArePrefixesAndATypelessEventLeavesNoTra
 
 TEST_F(EngineTest, TypesBeyondTheLimitsAreDroppedWithOneMessage) {
   SetDebugLevel(1);
-  auto rulebase = std::make_shared<Rulebase>();
-  (*rulebase)["a"].rules = {CountingRule("a")};
-  engine_.swapRulebase(rulebase);
+  engine_.swapRulebase(Rules({{"a", CountingRule("a")}}));
   auto repeated = [](const std::string& piece, size_t times) {
     std::string text;
     for (size_t i = 0; i < times; ++i) text += piece;

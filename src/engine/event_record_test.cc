@@ -87,19 +87,6 @@ TEST_F(EventRecordTest, FlattensDetailsBesideTopLevelKeysAndSetsTheFixedAttribut
             std::string::npos);
 }
 
-TEST_F(EventRecordTest, RecordsWhetherRulesExistedAndWhetherNoneFired) {
-  const std::tuple<bool, bool, const char*, const char*> cases[] = {
-      {false, false, "false", "false"},
-      {true, false, "true", "false"},
-      {true, true, "true", "true"}};
-  for (const auto& [hasRules, blocked, hasText, blockedText] : cases) {
-    unlink(path_.c_str());
-    const auto record = Only(Dictionary{{"eventType", "x"}}, hasRules, blocked);
-    EXPECT_EQ(record.attribute("hasRules"), hasText);
-    EXPECT_EQ(record.attribute("eventBlocked"), blockedText);
-  }
-}
-
 TEST_F(EventRecordTest, RefusesAnEventWithMoreAttributesThanARecordHolds) {
   Dictionary details;
   for (int i = 0; i < 1200; ++i) details.set("k" + std::to_string(i), Value("v"));

@@ -24,8 +24,6 @@ TEST(RulesCheck, ReportsEachMistakeWithFileRuleAndKeyPath) {
     const char* rule;
     const char* line;
   } kCases[] = {
-      {R"({name = ban; eventTypes = (a); critera = ({operator = true;});})",
-       R"(critera: unknown key, ignored (did you mean "criterion"?))"},
       {R"({name = ban; eventType = (a);})",
        R"(eventType: unknown key, ignored (did you mean "eventTypes"?))"},
       {R"({name = ban; eventTypes = a;})",
