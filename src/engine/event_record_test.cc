@@ -70,19 +70,27 @@ TEST_F(EventRecordTest, FlattensDetailsBesideTopLevelKeysAndSetsTheFixedAttribut
       {"count", Value::Integer(3)},
       {"hasRules", "overwritten"},
   };
-  const auto record = Only(event, true, true);
-  ASSERT_TRUE(record.parsed);
-  EXPECT_EQ(record.priority, 1);
-  const std::vector<std::pair<std::string, std::string>> expected = {
+  // The records of one event's prefixes share one gathering; each has its own flags.
+  EventRecord records(event);
+  records.write(false, false);
+  records.write(true, true);
+  const auto written = Records();
+  ASSERT_EQ(written.size(), 2u);
+  std::vector<std::pair<std::string, std::string>> expected = {
       {"eventType", "auth.failure"},
       {"eventSource", "details win"},
       {"clientIP", "10.1.2.3"},
       {"count", "3"},
-      {"hasRules", "true"},
-      {"eventBlocked", "true"},
+      {"hasRules", "false"},
+      {"eventBlocked", "false"},
       {"Level", "Alert"},
   };
-  EXPECT_EQ(record.attributes, expected);
+  EXPECT_EQ(written[0].priority, 1);
+  EXPECT_EQ(written[0].message, "auth.failure hasRules=false eventBlocked=false");
+  EXPECT_EQ(written[0].attributes, expected);
+  expected[4].second = expected[5].second = "true";
+  EXPECT_EQ(written[1].message, "auth.failure hasRules=true eventBlocked=true");
+  EXPECT_EQ(written[1].attributes, expected);
   EXPECT_NE(capture_.text().find("Logging event auth.failure to KVLOG tarvod database\n"),
             std::string::npos);
 }
@@ -90,10 +98,15 @@ TEST_F(EventRecordTest, FlattensDetailsBesideTopLevelKeysAndSetsTheFixedAttribut
 TEST_F(EventRecordTest, RefusesAnEventWithMoreAttributesThanARecordHolds) {
   Dictionary details;
   for (int i = 0; i < 1200; ++i) details.set("k" + std::to_string(i), Value("v"));
-  WriteEventRecord(Dictionary{{"eventType", "big"}, {"eventDetails", details}}, false, false);
+  const Dictionary event{{"eventType", "big"}, {"eventDetails", details}};
+  EventRecord records(event);
+  records.write(false, false);
+  records.write(true, false);
   EXPECT_TRUE(Records().empty());
-  EXPECT_NE(capture_.text().find("Failed to configure KVLOG message with key k999\n"),
-            std::string::npos);
+  const std::string refusal = "Failed to configure KVLOG message with key k999\n";
+  const std::string log = capture_.text();
+  ASSERT_NE(log.find(refusal), std::string::npos);
+  EXPECT_NE(log.find(refusal, log.find(refusal) + 1), std::string::npos);  // once per record
 }
 
 TEST(EventRecordJournal, AnUnreachableJournalCostsOnlyTheRecord) {
