@@ -53,7 +53,7 @@ struct MonitorHooks {
 // While more jobs than kBackPressureHighJobs wait on the processing queue, the input queue
 // reads no socket and no audit record; it reads again once at most kBackPressureLowJobs
 // wait. Senders meanwhile wait in the kernel's socket buffers: nothing is dropped, and the
-// events waiting inside the daemon stay below about kBackPressureHighJobs.
+// events waiting inside the daemon (one job each) stay below about kBackPressureHighJobs.
 inline constexpr size_t kBackPressureHighJobs = 2048;
 inline constexpr size_t kBackPressureLowJobs = 512;
 
