@@ -177,6 +177,31 @@ TEST_F(EngineTest, EmptyComponentsOfATypeArePrefixesAndATypelessEventLeavesNoTra
   EXPECT_EQ(testing::ReadJsonRecords(records_).size(), 2u);
 }
 
+TEST_F(EngineTest, PrefixesRunLongestFirstAndEachWritesItsRecord) {
+  // More prefixes with rules than an event's job keeps in place, and a full type without.
+  const char* const types[] = {"a", "a.b", "a.b.c", "a.b.c.d", "a.b.c.d.e"};
+  auto rulebase = std::make_shared<Rulebase>();
+  for (const char* type : types) {
+    (*rulebase)[type].rules.push_back(CountingRule(
+        type,
+        {{"variables", Dictionary{{"global:order", std::string("${global:order} ") + type}}}}));
+  }
+  engine_.swapRulebase(rulebase);
+  engine_.dispatchEvent({{"eventType", "a.b.c.d.e.f"}});
+  std::string order;
+  engine_.withVariables([&](VariableStore& store) {
+    order = store.findDictionary(kGlobalsKey)->find("order")->textForm();
+  });
+  EXPECT_EQ(order, "0 a.b.c.d.e a.b.c.d a.b.c a.b a");
+  const auto written = testing::ReadJsonRecords(records_);
+  ASSERT_EQ(written.size(), 6u);
+  EXPECT_EQ(written[0].attribute("hasRules"), "false");
+  for (size_t i = 1; i < written.size(); ++i) {
+    EXPECT_EQ(written[i].message, "a.b.c.d.e.f hasRules=true eventBlocked=false");
+  }
+  EXPECT_EQ(rulebase->at("a").eventCounter.load(), 1u);
+}
+
 TEST_F(EngineTest, TypesBeyondTheLimitsAreDroppedWithOneMessage) {
   SetDebugLevel(1);
   engine_.swapRulebase(Rules({{"a", CountingRule("a")}}));
