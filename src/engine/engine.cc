@@ -54,9 +54,11 @@ struct PrefixStep {
 // queued together would, in the same order.
 class EventJob {
  public:
-  EventJob(std::shared_ptr<const plist::Dictionary> event, RulebasePtr rulebase, double now,
-           VariableStorePtr variables, std::shared_ptr<Keychain> keychain, DryRun* dryRun)
-      : mEvent(std::move(event)),
+  EventJob(const SerialQueue& queue, std::shared_ptr<const plist::Dictionary> event,
+           RulebasePtr rulebase, double now, VariableStorePtr variables,
+           std::shared_ptr<Keychain> keychain, DryRun* dryRun)
+      : mQueue(&queue),
+        mEvent(std::move(event)),
         mRulebase(std::move(rulebase)),
         mNow(now),
         mVariables(std::move(variables)),
@@ -80,6 +82,7 @@ class EventJob {
 
  private:
   void run(const PrefixStep& step, EventRecord& record) const {
+    if (mQueue->abandoned()) return;
     if (step.entry == nullptr) {
       SerialQueue::BlockingSection blocking;
       record.write(false, false);
@@ -96,6 +99,9 @@ class EventJob {
 
     bool fired = false;
     for (const RulePtr& rule : rules) {
+      // Abandoned while an earlier rule was stuck: the rules not started are dropped, as
+      // queued jobs are, and the event's records with them.
+      if (mQueue->abandoned()) return;
       const auto start = std::chrono::steady_clock::now();
       const bool didFire = ProcessRule(*rule, context, mDryRun);
       fired = fired || didFire;
@@ -112,6 +118,7 @@ class EventJob {
     record.write(hasRules, hasRules && !fired);
   }
 
+  const SerialQueue* mQueue;
   std::shared_ptr<const plist::Dictionary> mEvent;
   RulebasePtr mRulebase;  // keeps the entries and their keys alive
   double mNow;
@@ -197,7 +204,8 @@ void Engine::dispatch(const plist::Dictionary& event, plist::Dictionary* owned, 
   // One event shared by every job of this dispatch: the caller's own when it handed it over.
   const auto shared = owned ? std::make_shared<const plist::Dictionary>(std::move(*owned))
                             : std::make_shared<const plist::Dictionary>(event);
-  EventJob job(shared, rulebase, now, dryRun ? dryRun->variables : mVariables, mKeychain, dryRun);
+  EventJob job(*mQueue, shared, rulebase, now, dryRun ? dryRun->variables : mVariables, mKeychain,
+               dryRun);
   ForEachTypePrefix(type, [&](std::string_view prefix) {
     auto found = rulebase->find(prefix);
     if (found != rulebase->end()) {

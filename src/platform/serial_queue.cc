@@ -135,6 +135,11 @@ size_t SerialQueue::abandon() {
   return dropped;
 }
 
+bool SerialQueue::abandoned() const {
+  std::lock_guard<std::mutex> lock(mLock);
+  return mAbandoned;
+}
+
 SerialQueue::BlockingSection::BlockingSection() : mQueue(tCurrentQueue) {
   if (!mQueue) return;
   {

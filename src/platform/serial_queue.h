@@ -62,6 +62,8 @@ class SerialQueue {
   // Drops every job not yet started and refuses new ones; returns how many were dropped.
   // A job already running finishes (or stays stuck) on its own.
   size_t abandon();
+  // True once abandoned: a long job stops between its steps, as the jobs after it were.
+  bool abandoned() const;
 
   bool isCurrentThread() const { return std::this_thread::get_id() == mThread.get_id(); }
 
