@@ -107,6 +107,8 @@ struct EventRecord::Attributes {
   // Where the flags go; failed holds the key the record could not take, if any.
   size_t hasRules = 0;
   size_t eventBlocked = 0;
+  // Everything before the first flag is the same in each record of the event.
+  AttributeCache cache;
   std::string failed;
   bool complete = false;
 };
@@ -136,7 +138,8 @@ void EventRecord::write(bool hasRules, bool eventBlocked) {
 
   const std::string message = a.type + " hasRules=" + (hasRules ? "true" : "false") +
                               " eventBlocked=" + (eventBlocked ? "true" : "false");
-  if (!DefaultStructuredLog().sendAttributes(kRecordPriority, message, a.record.attributes())) {
+  if (!DefaultStructuredLog().sendAttributes(kRecordPriority, message, a.record.attributes(),
+                                             a.cache)) {
     LogMessage(0, "Failed to log event %s to KVLOG tarvod database", a.type.c_str());
   }
 }
@@ -178,6 +181,7 @@ bool EventRecord::Gather(const plist::Dictionary& event, Attributes& a) {
   if (add("Level", "Alert") < 0) return false;
   a.hasRules = static_cast<size_t>(hasRules);
   a.eventBlocked = static_cast<size_t>(eventBlocked);
+  a.cache.stable = std::min(a.hasRules, a.eventBlocked);
   return true;
 }
 

@@ -87,28 +87,12 @@ class JsonLinesLog final : public StructuredLog {
 
   bool sendAttributes(int priority, std::string_view message,
                       std::span<const LogAttributeView> attributes) override {
-    // One lock around the descriptor and the held lines keeps lines whole and in order; the
-    // line is made in place, after the lines held before it.
-    std::lock_guard<std::mutex> guard(mLock);
-    if (mHeld.empty() && !current()) return false;
-    std::string& line = mHeld;
-    line += "{\"identifier\": \"tarvod\", \"priority\": ";
-    line += std::to_string(priority);
-    line += ", \"message\": ";
-    plist::AppendEscapedString(line, message);
-    line += ", \"attributes\": {";
-    bool first = true;
-    for (const auto& [name, value] : attributes) {
-      if (!first) line += ", ";
-      first = false;
-      plist::AppendEscapedString(line, name);
-      line += ": ";
-      plist::AppendEscapedString(line, value);
-    }
-    line += "}}\n";
-    ++mHeldRecords;
-    if (!tHoldRecords || mHeld.size() >= kMaxHeldRecordBytes) return writeHeld();
-    return true;
+    return send(priority, message, attributes, nullptr);
+  }
+  bool sendAttributes(int priority, std::string_view message,
+                      std::span<const LogAttributeView> attributes,
+                      AttributeCache& cache) override {
+    return send(priority, message, attributes, &cache);
   }
 
   void flush() override {
@@ -124,6 +108,46 @@ class JsonLinesLog final : public StructuredLog {
   }
 
  private:
+  bool send(int priority, std::string_view message, std::span<const LogAttributeView> attributes,
+            AttributeCache* cache) {
+    // One lock around the descriptor and the held lines keeps lines whole and in order; the
+    // line is made in place, after the lines held before it.
+    std::lock_guard<std::mutex> guard(mLock);
+    if (mHeld.empty() && !current()) return false;
+    std::string& line = mHeld;
+    line += "{\"identifier\": \"tarvod\", \"priority\": ";
+    line += std::to_string(priority);
+    line += ", \"message\": ";
+    plist::AppendEscapedString(line, message);
+    line += ", \"attributes\": {";
+    size_t done = 0;
+    if (cache != nullptr && cache->stable > 0 && cache->stable <= attributes.size()) {
+      if (!cache->filled) {
+        cache->text.clear();
+        AppendAttributes(cache->text, attributes.first(cache->stable), true);
+        cache->filled = true;
+      }
+      line += cache->text;
+      done = cache->stable;
+    }
+    AppendAttributes(line, attributes.subspan(done), done == 0);
+    line += "}}\n";
+    ++mHeldRecords;
+    if (!tHoldRecords || mHeld.size() >= kMaxHeldRecordBytes) return writeHeld();
+    return true;
+  }
+
+  static void AppendAttributes(std::string& out, std::span<const LogAttributeView> attributes,
+                               bool first) {
+    for (const auto& [name, value] : attributes) {
+      if (!first) out += ", ";
+      first = false;
+      plist::AppendEscapedString(out, name);
+      out += ": ";
+      plist::AppendEscapedString(out, value);
+    }
+  }
+
   // Makes mFd the file the path names now; false (and logged by the caller) when it cannot be
   // opened.
   bool current() {

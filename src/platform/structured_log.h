@@ -15,12 +15,26 @@ using LogAttributes = std::vector<std::pair<std::string, std::string>>;
 // An attribute seen through views, so that a record can be made of the event's own strings.
 using LogAttributeView = std::pair<std::string_view, std::string_view>;
 
+// What a sink keeps of the first `stable` attributes of a record for the next record that has
+// the same ones: the several records of one event differ only in their last attributes.
+struct AttributeCache {
+  size_t stable = 0;
+  bool filled = false;
+  std::string text;  // the sink's own form of those attributes
+};
+
 class StructuredLog {
  public:
   virtual ~StructuredLog() = default;
   // Sends one record; false when it could not be delivered.
   virtual bool sendAttributes(int priority, std::string_view message,
                               std::span<const LogAttributeView> attributes) = 0;
+  // The same, for a caller that sends records with the same first cache.stable attributes
+  // (unchanged since the cache was first used); a sink may reuse their formatted form.
+  virtual bool sendAttributes(int priority, std::string_view message,
+                              std::span<const LogAttributeView> attributes, AttributeCache& cache) {
+    return sendAttributes(priority, message, attributes);
+  }
   bool send(int priority, std::string_view message, const LogAttributes& attributes) {
     std::vector<LogAttributeView> views(attributes.begin(), attributes.end());
     return sendAttributes(priority, message, views);
