@@ -54,8 +54,9 @@ struct MonitorHooks {
 // reads no socket and no audit record; it reads again once at most kBackPressureLowJobs
 // wait. Senders meanwhile wait in the kernel's socket buffers: nothing is dropped, and the
 // events waiting inside the daemon (one job each) stay below about kBackPressureHighJobs.
-inline constexpr size_t kBackPressureHighJobs = 2048;
-inline constexpr size_t kBackPressureLowJobs = 512;
+// A shorter queue is also a faster one: the events waiting stay in the processor's caches.
+inline constexpr size_t kBackPressureHighJobs = 1024;
+inline constexpr size_t kBackPressureLowJobs = 256;
 
 // So that no local user can take every connection to the event socket: a connection that
 // sends nothing for this many seconds is closed, and each user but root may hold this many
