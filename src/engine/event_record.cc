@@ -89,7 +89,7 @@ std::pair<uint64_t, uint64_t> UnixTime(double since2001) {
   return {seconds, nanoseconds};
 }
 
-// Sets one attribute; false, with the failure logged, when the record cannot take it.
+// Sets one attribute: its index, or -1, with the failure logged, when the record cannot take it.
 ptrdiff_t Configure(Record& record, std::string_view name, std::string_view value) {
   const ptrdiff_t index = record.set(name, value);
   if (index < 0) {
@@ -104,13 +104,14 @@ ptrdiff_t Configure(Record& record, std::string_view name, std::string_view valu
 struct EventRecord::Attributes {
   std::string type;
   Record record;
-  // Where the flags go; failed holds the key the record could not take, if any.
+  // Where the flags go.
   size_t hasRules = 0;
   size_t eventBlocked = 0;
   // Everything before the first flag is the same in each record of the event.
   AttributeCache cache;
-  std::string failed;
+  // Whether every attribute was taken; if not, the name of the one refused.
   bool complete = false;
+  std::string failed;
 };
 
 EventRecord::EventRecord(const plist::Dictionary& event) : mEvent(event) {}
