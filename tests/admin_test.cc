@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <fstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -56,6 +57,23 @@ TEST_F(AdminTest, CheckReportsBrokenFilesAndPassesTheExamples) {
   const std::string clean = dir.write("clean.plist", RulesDocument({RuleXml("none", {})}));
   EXPECT_EQ(Tarvodctl({"check", "-c", dir.file("none"), "-r", clean}).status, 0);
   EXPECT_EQ(Tarvodctl({"check", "--strict", "-c", dir.file("none"), "-r", clean}).status, 1);
+
+  // Every key the README documents is one the check knows.
+  std::ifstream readme(std::string(TARVOD_SOURCE_DIR) + "/README.md");
+  ConfigEntries documented;
+  bool inTable = false;
+  for (std::string line; std::getline(readme, line);) {
+    inTable = line.starts_with("| `debugLevel` |") || (inTable && line.starts_with("| `"));
+    if (!inTable) continue;
+    const std::string key = line.substr(3, line.find('`', 3) - 3);
+    const std::string type = line.substr(line.find("| ", 3) + 2, 6);
+    if (type == "string") documented.push_back({key, Str(key == "authLogSource" ? "none" : "1")});
+    if (type == "intege" || type == "boolea") documented.push_back({key, Int(1)});
+  }
+  EXPECT_GE(documented.size(), 19u);
+  const std::string everyKey = dir.write("every.plist", ConfigPlist(documented));
+  const RunResult every = Tarvodctl({"check", "-c", everyKey, "-r", clean});
+  EXPECT_EQ(every.status, 0) << every.out;
 
   for (const char* examples : {"examples/rules", "examples/rulesets"}) {
     const RunResult example = Tarvodctl({"check", "--strict", "-c",

@@ -14,14 +14,15 @@ namespace {
 using Severity = Problem::Severity;
 
 constexpr std::array<std::string_view, 2> kTopLevelKeys = {"config", "initialGlobals"};
-constexpr std::array<std::string_view, 8> kStringKeys = {
-    "errorLogPath",    "eventLogPath",  "keychainPath",   "structuredLogPath",
-    "eventSocketPath", "authLogSource", "stateDirectory", "rulesPath"};
+constexpr std::array<std::string_view, 10> kStringKeys = {
+    "errorLogPath",  "eventLogPath",   "keychainPath", "structuredLogPath", "eventSocketPath",
+    "authLogSource", "stateDirectory", "rulesPath",    "mailProgram",       "relayMailProgram"};
 constexpr std::array<std::string_view, 2> kIdListKeys = {"filterByUID", "filterByGID"};
 constexpr std::array<std::string_view, 6> kNumberKeys = {
     "debugLevel",     "logRepeatInterval",     "shutdownTimeout",
     "commandTimeout", "connectionIdleTimeout", "maxConnectionsPerUID"};
-constexpr std::array<std::string_view, 2> kSwitchKeys = {"logEvents", "saveState"};
+constexpr std::array<std::string_view, 3> kSwitchKeys = {"logEvents", "saveState",
+                                                         "keepLogFilesOpen"};
 constexpr std::array<std::string_view, 3> kPeriodicKeys = {"eventType", "startInterval",
                                                            "startTime"};
 
