@@ -136,6 +136,14 @@ TEST_F(DaemonTest, RulesTreeLoadsEveryRulesFileAtAnyDepth) {
   EXPECT_THAT(log, HasSubstr("LOADING RULES (" + dir.file("rules.d/.hidden/three.plist") + ")"));
 }
 
+TEST_F(DaemonTest, AtLevelZeroTheRulesSummarySaysWhereToSeeTheProblems) {
+  const std::string rules = dir.write(
+      "bad.plist", RulesDocument({RuleXml("r", {"a"}, {{"critera", Arr({Criterion("true")})}})}));
+  Daemon daemon({"-c", writeConfig(), "-r", rules}, dir);
+  ASSERT_TRUE(daemon.waitForLine(errorLog, "problems found"));
+  EXPECT_THAT(ReadFile(errorLog), HasSubstr("1 problems found (tarvodctl check lists them)\n"));
+}
+
 TEST_F(DaemonTest, SigusrOneIsIgnoredAndSigtermWithSighupStopsWithoutReloading) {
   Daemon daemon({"-c", writeConfig(), "-r", writeOneRule(), "-v", "1"}, dir);
   ASSERT_TRUE(daemon.waitForLine(errorLog, "Registered"));

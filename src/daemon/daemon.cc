@@ -53,10 +53,13 @@ RulebasePtr LoadRulesReporting(Engine& engine, const std::string& configurationP
   for (const Problem& problem : report.problems) {
     LogMessage(1, "%s", FormatProblem(problem).c_str());
   }
-  LogMessage(
-      0, "Rules from %s: %zu files read, %zu rules loaded, %zu files skipped, %zu problems found",
-      rulesPath.c_str(), report.filesRead, report.rulesLoaded, report.filesSkipped,
-      report.problems.size());
+  // At the default debug level the problems themselves are not written: say where to see them.
+  const bool hidden = !report.problems.empty() && DebugLevel() < 1;
+  LogMessage(0,
+             "Rules from %s: %zu files read, %zu rules loaded, %zu files skipped, %zu problems "
+             "found%s",
+             rulesPath.c_str(), report.filesRead, report.rulesLoaded, report.filesSkipped,
+             report.problems.size(), hidden ? " (tarvodctl check lists them)" : "");
   return rulebase;
 }
 
