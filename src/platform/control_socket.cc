@@ -10,6 +10,8 @@
 #include <cstring>
 #include <vector>
 
+#include "platform/worker_thread.h"
+
 namespace tarvod {
 namespace {
 
@@ -44,7 +46,7 @@ std::unique_ptr<ControlSocket> ControlSocket::Start(const std::string& path, Ans
   }
   std::unique_ptr<ControlSocket> socket(
       new ControlSocket(path, std::move(listener), stopFd, std::move(answer)));
-  socket->mThread = std::thread([raw = socket.get()] { raw->run(); });
+  socket->mThread = StartWorkerThread([raw = socket.get()] { raw->run(); });
   return socket;
 }
 

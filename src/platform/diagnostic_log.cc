@@ -21,6 +21,7 @@
 
 #include "platform/clock.h"
 #include "platform/repeat_limiter.h"
+#include "platform/worker_thread.h"
 
 namespace tarvod {
 namespace {
@@ -181,7 +182,7 @@ void LogMessage(int64_t level, const char* format, ...) {
   if (level <= kHighestLimitedLevel) {
     write = log.mRepeats.admit(std::string_view(log.mBuffer, length), log.mSummaries);
     if (!write && !log.mSummaryWriter.joinable()) {
-      log.mSummaryWriter = std::thread(RunSummaryWriter, std::ref(log));
+      log.mSummaryWriter = StartWorkerThread([&log] { RunSummaryWriter(log); });
     } else if (write && log.mWriterIdle) {
       log.mWindowsChanged.notify_one();  // a window opened: the writer waits for its end
     }

@@ -8,6 +8,8 @@
 #include <condition_variable>
 #include <future>
 
+#include "platform/worker_thread.h"
+
 namespace tarvod {
 namespace {
 
@@ -65,7 +67,7 @@ EventLoop::EventLoop(std::string label) : mLabel(std::move(label)) {
     mEvent = sd_event_unref(mEvent);
     return;
   }
-  mThread = std::thread([this] { run(); });
+  mThread = StartWorkerThread([this] { run(); });
   std::string name = mLabel.size() > 15 ? mLabel.substr(mLabel.size() - 15) : mLabel;
   pthread_setname_np(mThread.native_handle(), name.c_str());
 }

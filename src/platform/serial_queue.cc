@@ -6,6 +6,8 @@
 
 #include <chrono>
 
+#include "platform/worker_thread.h"
+
 namespace tarvod {
 namespace {
 
@@ -20,7 +22,7 @@ void Signal(int fd) {
 
 SerialQueue::SerialQueue(std::string label) : mLabel(std::move(label)) {
   mProgressFd = eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
-  mThread = std::thread([this] {
+  mThread = StartWorkerThread([this] {
     tCurrentQueue = this;
     run();
   });

@@ -1,6 +1,8 @@
 #include "platform/serial_queue.h"
 
 #include <gtest/gtest.h>
+#include <pthread.h>
+#include <signal.h>
 
 #include <atomic>
 #include <mutex>
@@ -71,6 +73,19 @@ TEST(SerialQueue, RunsTheIdleHandlerWhenEmptyAndBeforeWaitsReturn) {
   queue.async([&] { ++jobsDone; });
   EXPECT_TRUE(queue.drainFor(5.0));  // returns once the idle handler has run too
   EXPECT_EQ(idles, before + 1);
+}
+
+// The process's stop and reload signals go to the main thread, never to a queue's.
+TEST(SerialQueue, ItsThreadBlocksTheSignalsThatSteerTheProcessAndLeavesTheCallersMask) {
+  SerialQueue queue("test.signals");
+  sigset_t inQueue;
+  queue.sync([&] { pthread_sigmask(SIG_BLOCK, nullptr, &inQueue); });
+  for (const int signal : {SIGTERM, SIGINT, SIGHUP, SIGUSR1}) {
+    EXPECT_TRUE(sigismember(&inQueue, signal)) << signal;
+  }
+  sigset_t here;
+  pthread_sigmask(SIG_BLOCK, nullptr, &here);
+  EXPECT_FALSE(sigismember(&here, SIGTERM));
 }
 
 TEST(SerialQueue, SyncFromTheQueueItselfRunsInline) {
