@@ -17,8 +17,6 @@ namespace {
 constexpr uid_t kDefaultUserID = 99;
 constexpr gid_t kDefaultGroupID = 99;
 constexpr mode_t kOutputMode = 0640;
-// How long a program that outlived its limit gets between SIGTERM and SIGKILL.
-constexpr double kTerminationGraceSeconds = 2.0;
 
 // The program's arguments: every string of the resolved array colon-unescaped, an array's
 // elements' text forms joined with ",", anything else its text form.
@@ -215,16 +213,10 @@ void RunCommandAction::perform(const plist::Dictionary& action, const FiredRule&
   }
   Result<ChildProcess> child = mLauncher.launch(request);
   if (!child.ok()) return;
-  std::optional<ExitStatus> status =
-      mLauncher.wait(child.value(), limit > 0 ? std::optional<double>(limit) : std::nullopt);
-  if (!status) {
-    LogMessage(0,
-               "DoRunAction: %s still running after %g seconds; ending its process group "
-               "(SIGTERM, SIGKILL %g seconds later)",
-               request.program.c_str(), limit, kTerminationGraceSeconds);
-    status = mLauncher.terminate(child.value(), kTerminationGraceSeconds);
-  }
-  LogMessage(3, "DoRunAction: %s exited with status %d", request.program.c_str(), *status);
+  const ExitStatus status =
+      WaitOrEnd(mLauncher, child.value(), limit > 0 ? std::optional<double>(limit) : std::nullopt,
+                "DoRunAction", request.program, limit);
+  LogMessage(3, "DoRunAction: %s exited with status %d", request.program.c_str(), status);
 }
 
 }  // namespace tarvod

@@ -18,7 +18,6 @@ constexpr int kMaxNestingLevel = 5;
 constexpr size_t kShortMessageBytes = 159;
 // Only the first six characters of an entry can hold a language prefix and its colon.
 constexpr size_t kPrefixColonRange = 6;
-constexpr double kTerminationGraceSeconds = 2.0;
 constexpr std::string_view kSafeCharacters =
     "!*+-/=_0123456789abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
 
@@ -450,16 +449,10 @@ int SendEmailAction::submit(Mail mail, const Context& context) {
     const std::chrono::duration<double> spent = std::chrono::steady_clock::now() - started;
     left = std::max(0.0, limit - spent.count());
   }
-  std::optional<ExitStatus> status = mLauncher.wait(child.value(), left);
-  if (!status) {
-    LogMessage(0,
-               "SendMail: %s still running after %g seconds; ending its process group "
-               "(SIGTERM, SIGKILL %g seconds later)",
-               request.program.c_str(), limit, kTerminationGraceSeconds);
-    status = mLauncher.terminate(child.value(), kTerminationGraceSeconds);
-  }
-  LogMessage(3, "SendMail: %s exited with status %d", request.program.c_str(), *status);
-  return *status;
+  const ExitStatus status =
+      WaitOrEnd(mLauncher, child.value(), left, "SendMail", request.program, limit);
+  LogMessage(3, "SendMail: %s exited with status %d", request.program.c_str(), status);
+  return status;
 }
 
 }  // namespace tarvod

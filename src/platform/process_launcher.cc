@@ -379,4 +379,14 @@ ProcessLauncher& ProcessLauncher::Real() {
   return launcher;
 }
 
+ExitStatus WaitOrEnd(ProcessLauncher& launcher, ChildProcess& child, std::optional<double> wait,
+                     const char* caller, const std::string& program, double limit) {
+  if (std::optional<ExitStatus> status = launcher.wait(child, wait)) return *status;
+  LogMessage(0,
+             "%s: %s still running after %g seconds; ending its process group "
+             "(SIGTERM, SIGKILL %g seconds later)",
+             caller, program.c_str(), limit, kTerminationGraceSeconds);
+  return launcher.terminate(child, kTerminationGraceSeconds);
+}
+
 }  // namespace tarvod

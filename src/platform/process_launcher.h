@@ -104,4 +104,13 @@ class ProcessLauncher {
   static ProcessLauncher& Real();
 };
 
+// How long a program that outlived its limit gets between SIGTERM and SIGKILL.
+inline constexpr double kTerminationGraceSeconds = 2.0;
+
+// Waits for child for at most wait seconds (none: without limit). A child still running then
+// is reported at level 0 as "CALLER: PROGRAM still running after LIMIT seconds; ..." and its
+// process group ended. Returns the child's status.
+ExitStatus WaitOrEnd(ProcessLauncher& launcher, ChildProcess& child, std::optional<double> wait,
+                     const char* caller, const std::string& program, double limit);
+
 }  // namespace tarvod
