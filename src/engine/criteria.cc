@@ -162,17 +162,6 @@ Decision Decide(int code, const Value& first, const Value* second, Context& cont
   }
 }
 
-const char* KindName(const Value& v) {
-  if (v.isString()) return "string";
-  if (v.isBoolean()) return "boolean";
-  if (v.isInteger()) return "integer";
-  if (v.isNumber()) return "real";
-  if (v.isArray()) return "array";
-  if (v.isDictionary()) return "dictionary";
-  if (v.isDate()) return "date";
-  return "data";
-}
-
 }  // namespace
 
 bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Context& context,
@@ -240,9 +229,9 @@ bool ProcessCriteria(const plist::Dictionary& criterion, const Rule& rule, Conte
   if (dryRun) {
     // The kinds are shown: 5 and "5" print alike but are never equal.
     dryRun->note(
-        "  criterion: %s (%s) %s %s: %s", context.shownValue(first).c_str(), KindName(first),
+        "  criterion: %s (%s) %s %s: %s", context.shownValue(first).c_str(), plist::KindName(first),
         keyword.c_str(),
-        second ? (context.shownValue(*second) + " (" + KindName(*second) + ")").c_str() : "",
+        second ? (context.shownValue(*second) + " (" + plist::KindName(*second) + ")").c_str() : "",
         passed ? "passed" : "failed");
   }
   return passed;

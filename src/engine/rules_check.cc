@@ -89,15 +89,11 @@ size_t EditDistance(std::string_view a, std::string_view b) {
   return row[b.size()];
 }
 
-const char* KindName(const plist::Value& value) {
-  if (value.isString()) return "a string";
-  if (value.isBoolean()) return "a boolean";
-  if (value.isInteger()) return "an integer";
-  if (value.isNumber()) return "a real";
-  if (value.isArray()) return "an array";
-  if (value.isDictionary()) return "a dictionary";
-  if (value.isDate()) return "a date";
-  return "data";
+// The kind with its article, as the problem lines say it: "an integer", "a string", "data".
+std::string KindWithArticle(const plist::Value& value) {
+  const std::string kind = plist::KindName(value);
+  if (kind == "data") return kind;
+  return (kind == "integer" || kind == "array" ? "an " : "a ") + kind;
 }
 
 // The problems of one rule, each placed at a key path under it.
@@ -153,7 +149,7 @@ void RuleChecker::unknownKeys(const plist::Dictionary& dictionary, Names known,
 bool RuleChecker::expect(const plist::Value* value, bool right, const char* wanted,
                          const std::string& path) {
   if (value == nullptr || right) return true;
-  add(Severity::kError, path, "must be %s, not %s", wanted, KindName(*value));
+  add(Severity::kError, path, "must be %s, not %s", wanted, KindWithArticle(*value).c_str());
   return false;
 }
 
@@ -173,7 +169,8 @@ void RuleChecker::references(const plist::Value& value, const std::string& path)
 void RuleChecker::criterion(const plist::Value& entry, const std::string& path) {
   const plist::Dictionary* dictionary = entry.asDictionary();
   if (dictionary == nullptr) {
-    add(Severity::kError, path, "must be a dictionary, not %s; it always fails", KindName(entry));
+    add(Severity::kError, path, "must be a dictionary, not %s; it always fails",
+        KindWithArticle(entry).c_str());
     return;
   }
   unknownKeys(*dictionary, kCriterionKeys, path);
@@ -230,7 +227,8 @@ void RuleChecker::criterion(const plist::Value& entry, const std::string& path) 
 void RuleChecker::action(const plist::Value& entry, const std::string& path) {
   const plist::Dictionary* dictionary = entry.asDictionary();
   if (dictionary == nullptr) {
-    add(Severity::kError, path, "must be a dictionary, not %s; it does nothing", KindName(entry));
+    add(Severity::kError, path, "must be a dictionary, not %s; it does nothing",
+        KindWithArticle(entry).c_str());
     return;
   }
   const plist::Value* type = dictionary->find("type");
@@ -307,7 +305,8 @@ void RuleChecker::action(const plist::Value& entry, const std::string& path) {
 void RuleChecker::check(const plist::Value& element) {
   const plist::Dictionary* rule = element.asDictionary();
   if (rule == nullptr) {
-    add(Severity::kError, "", "must be a dictionary, not %s; skipped", KindName(element));
+    add(Severity::kError, "", "must be a dictionary, not %s; skipped",
+        KindWithArticle(element).c_str());
     return;
   }
   if (const plist::Value* name = rule->find("name")) mName = name->textForm();
@@ -333,7 +332,7 @@ void RuleChecker::check(const plist::Value& element) {
     add(Severity::kWarning, "eventTypes", "missing; the rule is skipped");
   } else if (!eventTypes->isArray()) {
     add(Severity::kError, "eventTypes", "must be an array, not %s; the rule is skipped",
-        KindName(*eventTypes));
+        KindWithArticle(*eventTypes).c_str());
   } else if (eventTypes->array().empty()) {
     add(Severity::kWarning, "eventTypes", "empty; the rule never runs");
   } else {
@@ -350,7 +349,7 @@ void RuleChecker::check(const plist::Value& element) {
         criterion(entry, Indexed("criterion", ++i));
     } else {
       add(Severity::kError, "criterion", "must be an array, not %s; the rule never fires",
-          KindName(*criteria));
+          KindWithArticle(*criteria).c_str());
     }
   }
   if (const plist::Value* actions = rule->find("actions")) {
@@ -359,7 +358,7 @@ void RuleChecker::check(const plist::Value& element) {
       for (const plist::Value& entry : actions->array()) action(entry, Indexed("actions", ++i));
     } else {
       add(Severity::kError, "actions", "must be an array, not %s; no action runs",
-          KindName(*actions));
+          KindWithArticle(*actions).c_str());
     }
   }
   if (const plist::Value* variables = rule->find("variables")) {
@@ -367,7 +366,7 @@ void RuleChecker::check(const plist::Value& element) {
       references(*variables, "variables");
     } else {
       add(Severity::kError, "variables", "must be a dictionary, not %s; none is set",
-          KindName(*variables));
+          KindWithArticle(*variables).c_str());
     }
   }
 }

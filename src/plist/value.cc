@@ -654,6 +654,17 @@ std::string Describe(const Dictionary& dictionary) {
   return out;
 }
 
+const char* KindName(const Value& value) {
+  if (value.isString()) return "string";
+  if (value.isBoolean()) return "boolean";
+  if (value.isInteger()) return "integer";
+  if (value.isNumber()) return "real";
+  if (value.isArray()) return "array";
+  if (value.isDictionary()) return "dictionary";
+  if (value.isDate()) return "date";
+  return "data";
+}
+
 std::string Value::textForm() const {
   switch (kind()) {
     case Kind::kString:

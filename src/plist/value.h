@@ -167,6 +167,10 @@ class Dictionary {
   std::vector<Entry> entries_;
 };
 
+// The kind of value as a word: "string", "boolean", "integer", "real", "array", "dictionary",
+// "date" or "data".
+const char* KindName(const Value& value);
+
 // The old-style text form ("{ key = value; }", "( a, b )") of a value: strings are quoted
 // unless they are plain words, nested containers are indented by four blanks per level.
 // This is what every message prints for a value, and what ReadPropertyList reads back.
